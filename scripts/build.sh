@@ -1,0 +1,8 @@
+#!/usr/bin/env bash
+# scripts/build.sh DIR [cmake options...]: configures and builds into DIR.
+set -euo pipefail
+cd "$(dirname "$0")/.."
+dir=$1
+shift
+cmake -S . -B "$dir" -G Ninja "$@" >/dev/null
+ninja -C "$dir" -j"$(nproc)"

@@ -1,0 +1,26 @@
+#!/usr/bin/env bash
+# Builds everything and runs the whole test suite three times: a plain
+# build (build/), AddressSanitizer with UndefinedBehaviorSanitizer
+# (build-asan/), and the concurrency tests under ThreadSanitizer
+# (build-tsan/). Exits non-zero when any test fails.
+set -euo pipefail
+cd "$(dirname "$0")/.."
+scripts/deps.sh
+
+run_suite() {
+  local dir=$1 label=$2
+  shift 2
+  echo "== $dir: build"
+  scripts/build.sh "$dir" "$@"
+  echo "== $dir: tests ${label:+(label $label)}"
+  ctest --test-dir "$dir" --output-on-failure -j2 ${label:+-L "$label"}
+}
+
+export ASAN_OPTIONS=detect_leaks=1:abort_on_error=1
+export UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1
+export TSAN_OPTIONS=halt_on_error=1:second_deadlock_stack=1
+
+run_suite build ""
+run_suite build-asan "" -DWQ5_SANITIZE=address,undefined
+run_suite build-tsan concurrency -DWQ5_SANITIZE=thread
+echo "All test suites passed."

@@ -1,0 +1,45 @@
+// A reference-counted owning pointer. The count is not atomic: copies of one
+// counted_ptr are made and destroyed under the lock that guards the
+// container holding them, or by a single thread.
+#ifndef WQ5_UCOUNTEDPTR_H
+#define WQ5_UCOUNTEDPTR_H
+
+template <class X>
+class counted_ptr {
+public:
+    // Takes ownership of `p` (which may be null) with a new count of 1.
+    explicit counted_ptr(X* p) : m_ptr(p), m_pcount(new long(1)) {}
+
+    counted_ptr(const counted_ptr& r) : m_ptr(r.m_ptr), m_pcount(r.m_pcount) { ++*m_pcount; }
+
+    counted_ptr& operator=(const counted_ptr& r)
+    {
+        if (this != &r) {
+            dispose();
+            m_ptr = r.m_ptr;
+            m_pcount = r.m_pcount;
+            ++*m_pcount;
+        }
+        return *this;
+    }
+
+    ~counted_ptr() { dispose(); }
+
+    X& operator*() const { return *m_ptr; }
+    X* get() const { return m_ptr; }
+    long use_count() const { return *m_pcount; }
+
+private:
+    void dispose()
+    {
+        if (--*m_pcount == 0) {
+            delete m_pcount;
+            delete m_ptr;
+        }
+    }
+
+    X* m_ptr;
+    long* m_pcount;
+};
+
+#endif

@@ -34,33 +34,6 @@ namespace {
 // becomes 0, the value of a block that has never been synchronised.
 unsigned int g_generation = 1;
 
-struct Library {
-    explicit Library(const moq::Settings& settings) : mask(settings.mask), fd(settings.fd) {}
-
-    std::atomic<int> mask;
-    const int fd;
-
-    // Serialises the refreshing of block caches, see TRC1_Sync.
-    std::mutex syncLock;
-
-    // Guards the sink; held while the sink runs, so that once MOQ_SetSink
-    // returns the previous sink is neither running nor called again.
-    std::mutex sinkLock;
-    std::atomic<bool> sinkSet{false};
-    MOQ_Sink sink = nullptr;
-    void* sinkContext = nullptr;
-};
-
-// Reads the settings on first use, on whichever thread gets there first.
-// Never destroyed: other libraries may still trace from their exit-time
-// destructors.
-Library& library()
-{
-    static Library* const lib = new Library(
-        moq::loadSettings(std::getenv("MOQ_TRACE"), std::getenv("MOQ_TRACE_FILE"), STDERR_FILENO));
-    return *lib;
-}
-
 // Tracing must not disturb the caller's errno: callers often trace a
 // failure and then act on the errno that caused it.
 class ErrnoKeeper {
@@ -116,6 +89,171 @@ void appendEscaped(std::string& out, const char* text, size_t length)
 void appendEscaped(std::string& out, const char* text)
 {
     appendEscaped(out, text, std::strlen(text));
+}
+
+// Settings: MOQ_TRACE and MOQ_TRACE_FILE, read once on first use.
+
+bool sameWord(const char* text, size_t length, const char* word)
+{
+    if (std::strlen(word) != length)
+        return false;
+    for (size_t i = 0; i < length; ++i)
+        if (std::tolower(static_cast<unsigned char>(text[i])) != word[i])
+            return false;
+    return true;
+}
+
+bool parseNumber(const char* text, int* mask)
+{
+    const bool hex = text[0] == '0' && (text[1] == 'x' || text[1] == 'X');
+    const char* digits = hex ? text + 2 : text;
+    const unsigned base = hex ? 16 : 10;
+    if (*digits == '\0')
+        return false;
+    unsigned long long value = 0;
+    for (const char* p = digits; *p != '\0'; ++p) {
+        const unsigned char c = static_cast<unsigned char>(*p);
+        unsigned digit;
+        if (std::isdigit(c))
+            digit = c - '0';
+        else if (hex && std::isxdigit(c))
+            digit = static_cast<unsigned>(std::tolower(c) - 'a' + 10);
+        else
+            return false;
+        value = value * base + digit;
+        if (value > static_cast<unsigned long long>(INT_MAX))
+            return false;
+    }
+    *mask = static_cast<int>(value);
+    return true;
+}
+
+bool parseList(const char* text, int* mask)
+{
+    static const struct {
+        const char* name;
+        int bits;
+    } NAMES[] = {
+        {"error", TRC_ERROR}, {"flow", TRC_FLOW}, {"info", TRC_INFO},
+        {"detail", TRC_DETAIL}, {"all", moq::ALL_MASK}, {"none", 0},
+    };
+    int result = 0;
+    const char* item = text;
+    for (;;) {
+        const char* end = std::strchr(item, ',');
+        if (end == nullptr)
+            end = item + std::strlen(item);
+        const char* first = item;
+        const char* last = end;
+        while (first < last && std::isspace(static_cast<unsigned char>(*first)))
+            ++first;
+        while (last > first && std::isspace(static_cast<unsigned char>(last[-1])))
+            --last;
+        bool known = false;
+        for (const auto& entry : NAMES) {
+            if (sameWord(first, static_cast<size_t>(last - first), entry.name)) {
+                result |= entry.bits;
+                known = true;
+                break;
+            }
+        }
+        if (!known)
+            return false;
+        if (*end == '\0')
+            break;
+        item = end + 1;
+    }
+    *mask = result;
+    return true;
+}
+
+}  // namespace
+
+namespace moq {
+
+bool parseMask(const char* text, int* mask)
+{
+    if (text == nullptr || mask == nullptr || *text == '\0')
+        return false;
+    if (std::isdigit(static_cast<unsigned char>(text[0])))
+        return parseNumber(text, mask);
+    return parseList(text, mask);
+}
+
+}  // namespace moq
+
+namespace {
+
+void reportSetting(int fd, const char* what, const char* value, const char* problem)
+{
+    std::string text = "moq: ";
+    text += what;
+    text += " <";
+    appendEscaped(text, value);
+    text += "> ";
+    text += problem;
+    text += '\n';
+    writeAll(fd, text.data(), text.size());
+}
+
+struct Settings {
+    int mask;  // initial class mask
+    int fd;    // where trace lines go: the opened trace file or 2
+};
+
+// Builds the settings from the values of MOQ_TRACE and MOQ_TRACE_FILE (null
+// or empty: unset). A value that cannot be used is reported with one line
+// on `reportFd` and its default taken instead. An opened trace file stays
+// open for the life of the process.
+Settings loadSettings(const char* traceValue, const char* fileValue, int reportFd)
+{
+    Settings settings{moq::DEFAULT_MASK, STDERR_FILENO};
+    if (traceValue != nullptr && *traceValue != '\0' && !moq::parseMask(traceValue, &settings.mask)) {
+        reportSetting(reportFd, "MOQ_TRACE", traceValue,
+                      "is neither a number nor a list of error, flow, info, detail, all, none;"
+                      " using error,flow,info");
+    }
+    if (fileValue != nullptr && *fileValue != '\0') {
+        const int fd = ::open(fileValue, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
+        if (fd >= 0) {
+            settings.fd = fd;
+        } else {
+            const int error = errno;
+            const std::string problem = "cannot be opened (errno " + std::to_string(error) + ": " +
+                                        std::strerror(error) + "); tracing to standard error";
+            reportSetting(reportFd, "MOQ_TRACE_FILE", fileValue, problem.c_str());
+        }
+    }
+    return settings;
+}
+
+// Trace lines: built whole, then handed to the sink or the trace file.
+
+struct Library {
+    explicit Library(const Settings& settings) : mask(settings.mask), fd(settings.fd) {}
+
+    std::atomic<int> mask;
+    const int fd;
+
+    // Serialises the refreshing of block caches, see TRC1_Sync.
+    std::mutex syncLock;
+
+    // Guards the sink; held while the sink runs, so that once MOQ_SetSink
+    // returns the previous sink is neither running nor called again.
+    std::mutex sinkLock;
+    std::atomic<bool> sinkSet{false};
+    MOQ_Sink sink = nullptr;
+    void* sinkContext = nullptr;
+};
+
+// Reads the settings on first use, on whichever thread gets there first.
+// Never destroyed: other libraries may still trace from their exit-time
+// destructors.
+Library& library()
+{
+    static Library* const lib = new Library(
+        loadSettings(std::getenv("MOQ_TRACE"), std::getenv("MOQ_TRACE_FILE"), STDERR_FILENO));
+    return *lib;
 }
 
 const char* unitName(const TRC1_EPB* block)
@@ -200,92 +338,6 @@ void appendMessage(std::string& out, const char* format, va_list args)
         out += " [cut at " + std::to_string(kept) + " of " + std::to_string(full) + " bytes]";
 }
 
-void reportSetting(int fd, const char* what, const char* value, const char* problem)
-{
-    std::string text = "moq: ";
-    text += what;
-    text += " <";
-    appendEscaped(text, value);
-    text += "> ";
-    text += problem;
-    text += '\n';
-    writeAll(fd, text.data(), text.size());
-}
-
-bool sameWord(const char* text, size_t length, const char* word)
-{
-    if (std::strlen(word) != length)
-        return false;
-    for (size_t i = 0; i < length; ++i)
-        if (std::tolower(static_cast<unsigned char>(text[i])) != word[i])
-            return false;
-    return true;
-}
-
-bool parseNumber(const char* text, int* mask)
-{
-    const bool hex = text[0] == '0' && (text[1] == 'x' || text[1] == 'X');
-    const char* digits = hex ? text + 2 : text;
-    const unsigned base = hex ? 16 : 10;
-    if (*digits == '\0')
-        return false;
-    unsigned long long value = 0;
-    for (const char* p = digits; *p != '\0'; ++p) {
-        const unsigned char c = static_cast<unsigned char>(*p);
-        unsigned digit;
-        if (std::isdigit(c))
-            digit = c - '0';
-        else if (hex && std::isxdigit(c))
-            digit = static_cast<unsigned>(std::tolower(c) - 'a' + 10);
-        else
-            return false;
-        value = value * base + digit;
-        if (value > static_cast<unsigned long long>(INT_MAX))
-            return false;
-    }
-    *mask = static_cast<int>(value);
-    return true;
-}
-
-bool parseList(const char* text, int* mask)
-{
-    static const struct {
-        const char* name;
-        int bits;
-    } NAMES[] = {
-        {"error", TRC_ERROR}, {"flow", TRC_FLOW}, {"info", TRC_INFO},
-        {"detail", TRC_DETAIL}, {"all", moq::ALL_MASK}, {"none", 0},
-    };
-    int result = 0;
-    const char* item = text;
-    for (;;) {
-        const char* end = std::strchr(item, ',');
-        if (end == nullptr)
-            end = item + std::strlen(item);
-        const char* first = item;
-        const char* last = end;
-        while (first < last && std::isspace(static_cast<unsigned char>(*first)))
-            ++first;
-        while (last > first && std::isspace(static_cast<unsigned char>(last[-1])))
-            --last;
-        bool known = false;
-        for (const auto& entry : NAMES) {
-            if (sameWord(first, static_cast<size_t>(last - first), entry.name)) {
-                result |= entry.bits;
-                known = true;
-                break;
-            }
-        }
-        if (!known)
-            return false;
-        if (*end == '\0')
-            break;
-        item = end + 1;
-    }
-    *mask = result;
-    return true;
-}
-
 void printfLine(const TRC1_EPB* block, int line, const char* format, va_list args) noexcept
 {
     try {
@@ -298,41 +350,6 @@ void printfLine(const TRC1_EPB* block, int line, const char* format, va_list arg
 }
 
 }  // namespace
-
-namespace moq {
-
-bool parseMask(const char* text, int* mask)
-{
-    if (text == nullptr || mask == nullptr || *text == '\0')
-        return false;
-    if (std::isdigit(static_cast<unsigned char>(text[0])))
-        return parseNumber(text, mask);
-    return parseList(text, mask);
-}
-
-Settings loadSettings(const char* traceValue, const char* fileValue, int reportFd)
-{
-    Settings settings{DEFAULT_MASK, STDERR_FILENO};
-    if (traceValue != nullptr && *traceValue != '\0' && !parseMask(traceValue, &settings.mask)) {
-        reportSetting(reportFd, "MOQ_TRACE", traceValue,
-                      "is neither a number nor a list of error, flow, info, detail, all, none;"
-                      " using error,flow,info");
-    }
-    if (fileValue != nullptr && *fileValue != '\0') {
-        const int fd = ::open(fileValue, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
-        if (fd >= 0) {
-            settings.fd = fd;
-        } else {
-            const int error = errno;
-            const std::string problem = "cannot be opened (errno " + std::to_string(error) + ": " +
-                                        std::strerror(error) + "); tracing to standard error";
-            reportSetting(reportFd, "MOQ_TRACE_FILE", fileValue, problem.c_str());
-        }
-    }
-    return settings;
-}
-
-}  // namespace moq
 
 // The C entry points let no exception out: a trace that cannot be built
 // (out of memory) is dropped, a mask that cannot be read is the default.

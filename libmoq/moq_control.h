@@ -18,7 +18,9 @@ int MOQ_GetMask(void);
 
 // Receives every finished trace line (with its newline) instead of the trace
 // file. May be called on any thread, also concurrently. A null sink restores
-// the trace file.
+// the trace file. Calls of the sink are serialised; once MOQ_SetSink returns,
+// the previous sink is neither running nor called again. A sink must not
+// trace or call MOQ_SetSink itself.
 typedef void (*MOQ_Sink)(void* context, const char* line, size_t length);
 void MOQ_SetSink(MOQ_Sink sink, void* context);
 

@@ -1,5 +1,5 @@
-// Settings of libmoq and their parsing: private to the library and its
-// tests, not part of the platform interface.
+// Settings of libmoq and the parsing of MOQ_TRACE: private to the library
+// and its tests, not part of the platform interface.
 #ifndef WQ5_LIBMOQ_MOQ_SETTINGS_H
 #define WQ5_LIBMOQ_MOQ_SETTINGS_H
 
@@ -26,17 +26,6 @@ constexpr size_t MAX_MESSAGE = 64 * 1024;
 // returns true; returns false with `mask` untouched for anything else,
 // including an empty text or an empty list item.
 MOQ_EXPORT bool parseMask(const char* text, int* mask);
-
-struct Settings {
-    int mask;  // initial class mask
-    int fd;    // where trace lines go: the opened trace file or 2
-};
-
-// Builds the settings from the values of MOQ_TRACE and MOQ_TRACE_FILE (null
-// or empty: unset). A value that cannot be used is reported with one line
-// on `reportFd` and its default taken instead. An opened trace file stays
-// open for the life of the process.
-MOQ_EXPORT Settings loadSettings(const char* traceValue, const char* fileValue, int reportFd);
 
 }  // namespace moq
 

@@ -22,6 +22,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
+#include <iterator>
 #include <system_error>
 
 #include <nlohmann/json.hpp>
@@ -62,6 +63,21 @@ long readSetting(const char* name, long min, long max, long fallback)
     const long value = std::strtol(text, &end, 10);
     if (errno != 0 || *end != '\0' || value < min || value > max) {
         report("%s=\"%s\" is not a number from %ld to %ld; using %ld", name, text, min, max, fallback);
+        return fallback;
+    }
+    return value;
+}
+
+// A rate: a decimal number from 0 to 1000000.
+double readRateSetting(const char* name, double fallback)
+{
+    const char* text = std::getenv(name);
+    if (text == nullptr || *text == '\0') return fallback;
+    char* end = nullptr;
+    errno = 0;
+    const double value = std::strtod(text, &end);
+    if (errno != 0 || *end != '\0' || !(value >= 0 && value <= 1e6)) {
+        report("%s=\"%s\" is not a number from 0 to 1000000; using %g", name, text, fallback);
         return fallback;
     }
     return value;
@@ -127,6 +143,8 @@ void writeStatusFile(const std::string& path, const ZUB1SIM_STATS& stats)
         {"unregistrations", stats.unregistrations},
         {"defineRequests", stats.defineRequests},
         {"filtersDefined", stats.filtersDefined},
+        {"entries", stats.entries},
+        {"skipped", stats.skipped},
     };
     const std::string text = status.dump() + "\n";
     const std::string temp = path + ".tmp";
@@ -177,6 +195,8 @@ Settings Settings::fromEnvironment()
     settings.startDelayMs =
         static_cast<int>(readSetting("ZUB1_START_DELAY_MS", 0, 3600000, settings.startDelayMs));
     settings.registerFailures = readSetting("ZUB1_REGISTER_FAILURES", 0, LONG_MAX, 0);
+    settings.loops = readSetting("ZUB1_LOOPS", 0, LONG_MAX, settings.loops);
+    settings.rate = readRateSetting("ZUB1_RATE", settings.rate);
     return settings;
 }
 
@@ -428,6 +448,7 @@ void Simulator::workerLoop()
             ++m_stats.delivered;
             ++m_version;
             ++appl->running;
+            ++m_callbacksRunning;
             lock.unlock();
 
             t_callbackAppl = appl->id;
@@ -440,44 +461,62 @@ void Simulator::workerLoop()
 
             lock.lock();
             --appl->running;
+            --m_callbacksRunning;
             m_applCv.notify_all();
+            std::optional<StatusWrite> status = progressLocked();
+            if (status) {
+                lock.unlock();
+                writeStatus(status);
+                lock.lock();
+            }
         }
     } catch (const std::exception& e) {
         report("a delivery thread ends: %s", e.what());
     }
 }
 
+// Spaces replayed tables ZUB1_RATE per second apart. A replay held up for
+// more than a second (no application registered, a full queue) goes on at
+// the rate from then on instead of catching up in a burst, so that the load
+// stays steady.
+class Simulator::Pacer {
+    using Clock = std::chrono::steady_clock;
+
+public:
+    explicit Pacer(double perSecond)
+        : m_interval(perSecond > 0 ? std::chrono::duration_cast<Clock::duration>(
+                                         std::chrono::duration<double>(1.0 / perSecond))
+                                   : Clock::duration::zero())
+    {
+    }
+    bool paced() const { return m_interval > Clock::duration::zero(); }
+    // When the next table is due; moves the schedule on by one table.
+    Clock::time_point next()
+    {
+        const Clock::time_point now = Clock::now();
+        if (!m_started || now - m_due > std::chrono::seconds(1)) m_due = now;
+        m_started = true;
+        const Clock::time_point due = m_due;
+        m_due += m_interval;
+        return due;
+    }
+
+private:
+    Clock::duration m_interval;
+    Clock::time_point m_due;
+    bool m_started = false;
+};
+
 void Simulator::replayLoop(std::string path)
 {
     t_libraryThread = true;
+    bool finished = true;
     try {
-        std::ifstream in(path, std::ios::binary);
-        if (!in) {
-            report("%s: cannot open: %s", path.c_str(), std::strerror(errno));
-        }
-        std::string line;
-        unsigned long lineNo = 0;
-        while (in && std::getline(in, line)) {
-            ++lineNo;
-            if (isSkippedLine(line)) continue;
-            ScriptTable table;
-            std::string error;
-            const bool valid = parseTableLine(line, table, error);
-            if (!valid) report("%s:%lu: %s", path.c_str(), lineNo, error.c_str());
-            Lock lock(m_mutex);
-            if (!valid) {
-                ++m_stats.invalid;
-                ++m_version;
-                continue;
-            }
-            m_spaceCv.wait(lock, [&] { return m_stop || m_queue.size() < REPLAY_QUEUE_LIMIT; });
-            if (m_stop) return;
-            enqueueLocked(std::move(table));
-        }
-        if (in.bad()) report("%s:%lu: read error: %s", path.c_str(), lineNo + 1, std::strerror(errno));
+        finished = replay(path);
     } catch (const std::exception& e) {
         report("%s: replay ends: %s", path.c_str(), e.what());
     }
+    if (!finished) return;  // stopped by a reset or the process end
     std::optional<StatusWrite> status;
     {
         Lock lock(m_mutex);
@@ -485,6 +524,131 @@ void Simulator::replayLoop(std::string path)
         status = progressLocked();
     }
     writeStatus(status);
+}
+
+// Replays `path` ZUB1_LOOPS times, or until stopped when that is 0. The file
+// is a HAR capture or a table script, told apart by its first bytes; a
+// capture is read and converted once, a script read again for each pass.
+// A pass that queues no table ends the repetition, since none would ever
+// come of it. Returns false when stopped.
+bool Simulator::replay(const std::string& path)
+{
+    std::string start(4096, '\0');
+    {
+        std::ifstream in(path, std::ios::binary);
+        if (!in) {
+            report("%s: cannot open: %s", path.c_str(), std::strerror(errno));
+            return true;
+        }
+        in.read(&start[0], static_cast<std::streamsize>(start.size()));
+        start.resize(static_cast<size_t>(in.gcount()));
+    }
+    std::optional<HarReplay> har;
+    if (looksLikeHar(start)) {
+        std::ifstream in(path, std::ios::binary);
+        const std::string content{std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+        std::string error = in.bad() ? std::string("read error: ") + std::strerror(errno) : "";
+        har.emplace();
+        if (!error.empty() || !convertHar(content, *har, error)) {
+            report("%s: not a HAR capture: %s", path.c_str(), error.c_str());
+            countInvalid();
+            return true;
+        }
+        for (const std::string& problem : har->problems) report("%s: %s", path.c_str(), problem.c_str());
+    }
+    Pacer pacer(m_settings.rate);
+    for (long pass = 0; m_settings.loops == 0 || pass < m_settings.loops; ++pass) {
+        uint64_t queued = 0;
+        const bool goOn = har ? replayCapture(path, *har, pass == 0, pacer, queued)
+                              : replayScript(path, pass == 0, pacer, queued);
+        if (!goOn) {
+            Lock lock(m_mutex);
+            return !m_stop;
+        }
+        if (queued == 0) {
+            if (m_settings.loops != 1) report("%s: nothing to replay; not repeated", path.c_str());
+            break;
+        }
+    }
+    return true;
+}
+// One pass over a table script. Invalid lines are counted in every pass and
+// reported in the first. False when the replay is to end: stopped, or the
+// script could not be read.
+bool Simulator::replayScript(const std::string& path, bool firstPass, Pacer& pacer, uint64_t& queued)
+{
+    std::ifstream in(path, std::ios::binary);
+    if (!in) {
+        report("%s: cannot open: %s", path.c_str(), std::strerror(errno));
+        return false;
+    }
+    std::string line;
+    unsigned long lineNo = 0;
+    while (std::getline(in, line)) {
+        ++lineNo;
+        if (isSkippedLine(line)) continue;
+        ScriptTable table;
+        std::string error;
+        if (!parseTableLine(line, table, error)) {
+            if (firstPass) report("%s:%lu: %s", path.c_str(), lineNo, error.c_str());
+            countInvalid();
+            continue;
+        }
+        if (!queueReplayed(std::move(table), pacer)) return false;
+        ++queued;
+    }
+    if (in.bad()) {
+        report("%s:%lu: read error: %s", path.c_str(), lineNo + 1, std::strerror(errno));
+        return false;
+    }
+    return true;
+}
+
+// One pass over a converted capture.
+bool Simulator::replayCapture(const std::string& path, const HarReplay& har, bool firstPass, Pacer& pacer,
+                              uint64_t& queued)
+{
+    {
+        Lock lock(m_mutex);
+        m_stats.entries += har.entries;
+        m_stats.skipped += har.skipped;
+        ++m_version;
+    }
+    size_t index = 0;
+    for (const nlohmann::json& doc : har.tables) {
+        ++index;
+        ScriptTable table;
+        std::string error;
+        // Fails only when memory runs out, or for a value the conversion
+        // should not have let through.
+        if (!buildTable(doc, table, error)) {
+            if (firstPass) report("%s: table %zu: %s", path.c_str(), index, error.c_str());
+            countInvalid();
+            continue;
+        }
+        if (!queueReplayed(std::move(table), pacer)) return false;
+        ++queued;
+    }
+    return true;
+}
+
+// Queues a replayed table when it is due and the queue has room; false when
+// stopped first.
+bool Simulator::queueReplayed(ScriptTable table, Pacer& pacer)
+{
+    Lock lock(m_mutex);
+    if (pacer.paced()) m_spaceCv.wait_until(lock, pacer.next(), [&] { return m_stop; });
+    m_spaceCv.wait(lock, [&] { return m_stop || m_queue.size() < REPLAY_QUEUE_LIMIT; });
+    if (m_stop) return false;
+    enqueueLocked(std::move(table));
+    return true;
+}
+
+void Simulator::countInvalid()
+{
+    Lock lock(m_mutex);
+    ++m_stats.invalid;
+    ++m_version;
 }
 
 void Simulator::enqueueLocked(ScriptTable table)
@@ -505,7 +669,10 @@ const Simulator::Filter* Simulator::findFilterLocked(uint16_t protocol, uint16_t
 
 bool Simulator::idleLocked() const
 {
-    return m_started && m_scriptDone && m_queue.empty() && m_stats.delivered == m_stats.freed;
+    // A callback may still run after it gave its table back; idle waits for
+    // it to return, so that a waiter sees everything the callback did.
+    return m_started && m_scriptDone && m_queue.empty() && m_stats.delivered == m_stats.freed &&
+           m_callbacksRunning == 0;
 }
 
 // Called after every change that may have made the simulator idle: wakes

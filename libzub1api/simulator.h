@@ -19,6 +19,7 @@
 #include <unordered_map>
 #include <vector>
 
+#include "libzub1api/har.h"
 #include "libzub1api/tablescript.h"
 #include "libzub1api/zub1sim.h"
 #include "zub/zub1api.h"
@@ -31,6 +32,8 @@ void report(const char* format, ...) __attribute__((format(printf, 1, 2)));
 // The ZUB1_* environment settings, read at the first registration.
 struct Settings {
     std::string replayPath;        // ZUB1_REPLAY; empty: no script
+    long loops = 1;                // ZUB1_LOOPS; 0: until stopped
+    double rate = 0;               // ZUB1_RATE, tables per second; 0: unpaced
     int threads = 2;               // ZUB1_THREADS
     int startDelayMs = 200;        // ZUB1_START_DELAY_MS
     std::string statusFile;        // ZUB1_STATUS_FILE; empty: none
@@ -90,7 +93,14 @@ private:
 
     void startLocked();
     void workerLoop();
+    class Pacer;
     void replayLoop(std::string path);
+    bool replay(const std::string& path);
+    bool replayScript(const std::string& path, bool firstPass, Pacer& pacer, uint64_t& queued);
+    bool replayCapture(const std::string& path, const HarReplay& har, bool firstPass, Pacer& pacer,
+                       uint64_t& queued);
+    bool queueReplayed(ScriptTable table, Pacer& pacer);
+    void countInvalid();
     void enqueueLocked(ScriptTable table);
     const Filter* findFilterLocked(uint16_t protocol, uint16_t service) const;
     bool idleLocked() const;
@@ -110,7 +120,7 @@ private:
     bool m_settingsRead = false;
     long m_refusalsLeft = 0;
     bool m_started = false;      // threads started since the last reset
-    bool m_scriptDone = false;   // the replay thread has read its whole script
+    bool m_scriptDone = false;   // the replay thread has done every pass
     bool m_stop = false;         // threads are to end (reset, shutdown)
     bool m_resetting = false;
     bool m_shutdown = false;
@@ -126,6 +136,7 @@ private:
     std::deque<ScriptTable> m_queue;
     std::chrono::steady_clock::time_point m_resumeAt;  // delivery waits until then
     std::unordered_map<void*, Delivered> m_delivered;  // handed out, not given back
+    int m_callbacksRunning = 0;                        // of every application
     std::deque<void*> m_quarantine;                    // given back, not yet freed
     uint64_t m_generation = 1;
     uint64_t m_deliverLineCalls = 0;

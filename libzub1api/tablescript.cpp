@@ -89,6 +89,26 @@ const FieldDesc* findField(const std::string& name)
 
 std::string quoted(const std::string& name) { return "\"" + name + "\""; }
 
+// A value as the messages quote it. dump() recurses once per level of
+// nesting, so a value nested deeper than any field could want (a line of
+// a hundred thousand '[') is named by its kind instead of overflowing the
+// stack; the depth is measured level by level, without recursion.
+std::string shown(const json& value)
+{
+    std::vector<const json*> level{&value};
+    for (int depth = 0; depth < 32 && !level.empty(); ++depth) {
+        std::vector<const json*> next;
+        for (const json* v : level) {
+            if (v->is_structured()) {
+                for (const json& child : *v) next.push_back(&child);
+            }
+        }
+        level.swap(next);
+    }
+    if (!level.empty()) return std::string("an ") + value.type_name() + " nested too deeply to show";
+    return value.dump(-1, ' ', false, json::error_handler_t::replace);
+}
+
 // Reads an integer in [min, max]. JSON fractions and integers beyond 64 bits
 // are no integers here.
 bool readInteger(const json& value, const std::string& name, long long min, long long max,
@@ -97,19 +117,19 @@ bool readInteger(const json& value, const std::string& name, long long min, long
     if (value.is_number_unsigned()) {
         const auto u = value.get<unsigned long long>();
         if (u > static_cast<unsigned long long>(max)) {
-            error = quoted(name) + " out of range: " + value.dump();
+            error = quoted(name) + " out of range: " + shown(value);
             return false;
         }
         out = static_cast<long long>(u);
         return true;
     }
     if (!value.is_number_integer()) {
-        error = quoted(name) + " must be an integer, not " + value.dump();
+        error = quoted(name) + " must be an integer, not " + shown(value);
         return false;
     }
     out = value.get<long long>();
     if (out < min || out > max) {
-        error = quoted(name) + " out of range: " + value.dump();
+        error = quoted(name) + " out of range: " + shown(value);
         return false;
     }
     return true;
@@ -140,7 +160,7 @@ bool storeField(const FieldDesc& field, const json& value, size_t index, EntryBy
         return true;
     case Kind::Inline: {
         if (!value.is_string()) {
-            error = quoted(field.name) + " must be a string, not " + value.dump();
+            error = quoted(field.name) + " must be a string, not " + shown(value);
             return false;
         }
         const std::string& text = value.get_ref<const std::string&>();
@@ -156,7 +176,7 @@ bool storeField(const FieldDesc& field, const json& value, size_t index, EntryBy
     case Kind::Text:
         if (value.is_null()) return true;
         if (!value.is_string()) {
-            error = quoted(field.name) + " must be a string or null, not " + value.dump();
+            error = quoted(field.name) + " must be a string or null, not " + shown(value);
             return false;
         }
         texts.push_back(PendingText{index, field.offset, value.get<std::string>()});
@@ -203,7 +223,7 @@ bool parseFilter(const json& value, ScriptTable& table, std::string& error)
     long long protocol = 0;
     long long service = 0;
     if (!value.is_array() || value.size() != 2) {
-        error = "\"filter\" must be [protocol, service], not " + value.dump();
+        error = "\"filter\" must be [protocol, service], not " + shown(value);
         return false;
     }
     if (!readInteger(value[0], "filter protocol", 0, UINT16_MAX, protocol, error) ||
@@ -280,6 +300,11 @@ bool parseTableLine(const std::string& line, ScriptTable& table, std::string& er
         error = std::string("invalid JSON: ") + e.what();
         return false;
     }
+    return buildTable(doc, table, error);
+}
+
+bool buildTable(const json& doc, ScriptTable& table, std::string& error)
+{
     if (!doc.is_object()) {
         error = "a table line must be a JSON object";
         return false;

@@ -7,6 +7,8 @@
 #include <memory>
 #include <string>
 
+#include <nlohmann/json_fwd.hpp>
+
 namespace zub1sim {
 
 struct AreaFree {
@@ -29,6 +31,10 @@ struct ScriptTable {
 // `table`; otherwise returns false with `error` saying what is wrong, in
 // words fit to follow "file:line: ".
 bool parseTableLine(const std::string& line, ScriptTable& table, std::string& error);
+
+// The same for a table already in JSON form (what one script line holds):
+// HAR captures are turned into such objects and built by the same rules.
+bool buildTable(const nlohmann::json& doc, ScriptTable& table, std::string& error);
 
 // True for the lines a script skips: empty, only blanks, or a comment whose
 // first non-blank character is '#'.

@@ -1,10 +1,10 @@
 // Control of the simulated collection library, for tests and tools; the
 // collector never calls these.
 //
-// The simulator behind zub/zub1api.h replays table scripts (JSON Lines, see
-// libzub1api/README.md) to the filters that the registered applications
-// define. These calls reset it, read its counters, wait until it has nothing
-// left to do and feed it single tables.
+// The simulator behind zub/zub1api.h replays table scripts (JSON Lines) and
+// HAR captures (see libzub1api/README.md) to the filters that the registered
+// applications define. These calls reset it, read its counters, wait until
+// it has nothing left to do and feed it single tables.
 #ifndef WQ5_LIBZUB1API_ZUB1SIM_H
 #define WQ5_LIBZUB1API_ZUB1SIM_H
 
@@ -39,6 +39,8 @@ typedef struct ZUB1SIM_STATS {
     uint64_t unregistrations;  // applications ended
     uint64_t defineRequests;   // accepted filter definitions
     uint64_t filtersDefined;   // filters defined now, over all applications
+    uint64_t entries;          // entries of replayed HAR captures, every pass counted
+    uint64_t skipped;          // of those, the ones that yielded no table entry
 } ZUB1SIM_STATS;
 
 // One filter as defined now.
@@ -63,8 +65,8 @@ void ZUB1SIM_GetStats(ZUB1SIM_STATS* stats);
 
 // Waits until the library has started (first registration), read the whole
 // script, handed out or dropped every queued table, every delivered table
-// has been given back and, with ZUB1_STATUS_FILE set, the status file shows
-// that state. Returns 0 then, or -1 when `timeoutMs` passed first. A negative
+// has been given back, every callback has returned and, with
+// ZUB1_STATUS_FILE set, the status file shows that state. Returns 0 then, or -1 when `timeoutMs` passed first. A negative
 // `timeoutMs` waits without limit.
 int ZUB1SIM_WaitIdle(int timeoutMs);
 

@@ -1,16 +1,18 @@
 #!/usr/bin/env bash
 # The collector's main job on a bundled default: builds the collector, runs
 # it with every traffic kind switched on while our collection library
-# replays samples/demo.jsonl, stops it with SIGTERM once every table has
-# been delivered and given back, and shows what it wrote.
+# replays the browser capture samples/demo.har, stops it with SIGTERM once
+# every table has been delivered and given back, and shows what it wrote.
 #
-#   scripts/demo.sh [table-script]
+#   scripts/demo.sh [capture.har | table-script.jsonl]
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/deps.sh
-scripts/build.sh build >/dev/null
+# Only what the main job runs: the collector and its two libraries.
+cmake -S . -B build -G Ninja >/dev/null
+ninja -C build wq5collector >/dev/null
 
-script=$(realpath "${1:-samples/demo.jsonl}")
+replay=$(realpath "${1:-samples/demo.har}")
 run=$PWD/demo-run
 rm -rf "$run"
 mkdir -p "$run/log"
@@ -20,14 +22,18 @@ export WQ5_COLLECTOR_ID=${WQ5_COLLECTOR_ID:-demo}
 for kind in HTTP HTTPOBJ HTTPS MS_VIDEO MS_AUDIO REAL_VIDEO REAL_AUDIO QUICKTIME; do
   export "WQ5_LOG_$kind=Y"
 done
-export ZUB1_REPLAY=$script
+export ZUB1_REPLAY=$replay
 export ZUB1_STATUS_FILE=$run/status.json
+# One delivery thread: tables arrive in capture order, so that every object
+# record carries the GUID of its own page.
+export ZUB1_THREADS=1
+export ZUB1_LOOPS=1 ZUB1_RATE=0
 export MOQ_TRACE=${MOQ_TRACE:-all}
 export MOQ_TRACE_FILE=$run/trace.log
 
 build/wq5collector &
 pid=$!
-# The library writes the status file once the whole script is delivered
+# The library writes the status file once the whole capture is delivered
 # and every table has been given back.
 for _ in $(seq 1 600); do
   [ -s "$run/status.json" ] && break

@@ -1,6 +1,5 @@
-// Log file naming, sequence numbers, the writer's rollover and reopen rules,
-// and retention. Every test runs in its own temporary directory and steps a
-// clock of its own over midnight instead of waiting for one.
+// Log file naming, sequence numbers, retention, and the writer's open, rollover
+// and recovery rules, in temporary directories, with a clock the tests step.
 #include "src/mdwriter.h"
 
 #include <gtest/gtest.h>
@@ -8,762 +7,322 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <climits>
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
 #include <filesystem>
-#include <fstream>
+#include <functional>
+#include <map>
 #include <set>
-#include <sstream>
-#include <string>
-#include <vector>
 
 #include "platform/moq.h"
+#include "support/process.h"
 #include "support/trace_capture.h"
 
 namespace fs = std::filesystem;
+using wq5test::readFile;
 
 namespace {
 
 // 2024-03-05 00:00:00 UTC: 2024-01-01 is 1704067200, plus 31 + 29 + 4 days.
-const wq5_time_t MAR05 = 1704067200 + 64 * 86400;
-const wq5_time_t DAY = 86400;
+const wq5_time_t MAR05 = 1704067200 + 64 * 86400, DAY = 86400, NOON = MAR05 + DAY / 2;
+const int64_t MB = 1048576;
 const int ALL_CLASSES = TRC_DETAIL | TRC_INFO | TRC_FLOW | TRC_ERROR;
 
+// The clock of every writer in these tests.
 std::atomic<wq5_time_t> g_now{0};
-wq5_time_t testClock()
-{
-    return g_now.load();
-}
+const bool s_clockSet = (setWriterClock([] { return g_now.load(); }), true);
 
-class TempDir {
-public:
-    TempDir()
-    {
-        std::string templ = (fs::temp_directory_path() / "mdwriter_XXXXXX").string();
-        std::vector<char> buf(templ.begin(), templ.end());
-        buf.push_back('\0');
-        if (mkdtemp(buf.data()) == nullptr)
-            ADD_FAILURE() << "mkdtemp failed: " << strerror(errno);
-        m_path = buf.data();
-    }
-    ~TempDir()
-    {
-        std::error_code ec;
-        fs::remove_all(m_path, ec);
-    }
-    const std::string& path() const { return m_path; }
-    std::string operator/(const std::string& name) const { return m_path + "/" + name; }
-
-private:
-    std::string m_path;
+struct TempDir {
+    const std::string path = wq5test::makeTempDir();
+    ~TempDir() { wq5test::removeTree(path); }
+    std::string operator/(const std::string& name) const { return path + "/" + name; }
 };
 
-void makeFile(const std::string& path, int64_t size = 0)
+typedef std::map<std::string, int64_t> Files;  // name -> size (-1: not a regular file)
+
+void makeFiles(const TempDir& dir, const Files& files)
 {
-    std::ofstream(path).close();
-    // Sparse: gigabyte files cost nothing.
-    ASSERT_EQ(truncate(path.c_str(), static_cast<off_t>(size)), 0) << path;
+    for (const auto& f : files) {
+        wq5test::writeFile(dir / f.first, "");
+        ASSERT_EQ(0, truncate((dir / f.first).c_str(), f.second)) << f.first;  // sparse: gigabytes cost nothing
+    }
 }
 
-std::string readFile(const std::string& path)
+Files listDir(const std::string& dir)
 {
-    std::ifstream in(path, std::ios::binary);
-    std::ostringstream out;
-    out << in.rdbuf();
-    return out.str();
-}
-
-int64_t fileSize(const std::string& path)
-{
-    struct stat st;
-    return stat(path.c_str(), &st) == 0 ? static_cast<int64_t>(st.st_size) : -1;
-}
-
-std::set<std::string> listDir(const std::string& dir)
-{
-    std::set<std::string> names;
+    Files files;
     for (const fs::directory_entry& e : fs::directory_iterator(dir))
-        names.insert(e.path().filename().string());
-    return names;
+        files[e.path().filename()] = e.is_regular_file() ? static_cast<int64_t>(e.file_size()) : -1;
+    return files;
 }
 
-// The record writer's road: lock, stream, one write, unlock. False when the
-// record was dropped.
+// A record writer's road: lock, stream, one write, unlock. False when the record was dropped.
 bool writeRecord(DataWriter& writer, const std::string& record)
 {
     DataWriterLock lock(writer);
     FILE* stream = lock.getStream();
-    if (stream == nullptr)
-        return false;
-    return fwrite(record.data(), record.size(), 1, stream) == 1;
+    return stream != nullptr && fwrite(record.data(), record.size(), 1, stream) == 1;
 }
 
-// True when some trace line holds `text` anywhere (for messages whose text
-// is not at the end of the line).
-bool traced(const TraceCapture& capture, const std::string& text)
+// The texts that `function` traced, in order.
+std::vector<std::string> traced(const TraceCapture& capture, const std::string& function)
 {
-    for (const std::string& line : capture.lines())
-        if (line.find(text) != std::string::npos)
-            return true;
-    return false;
-}
-
-class ClockTest : public ::testing::Test {
-protected:
-    void SetUp() override
-    {
-        g_now = MAR05 + 12 * 3600;
-        setWriterClock(&testClock);
+    const std::string mark = " " + function + ": ";
+    std::vector<std::string> texts;
+    for (const std::string& line : capture.lines()) {
+        const size_t at = line.find(mark);
+        if (at != std::string::npos)
+            texts.push_back(line.substr(at + mark.size(), line.size() - at - mark.size() - 1));
     }
-    void TearDown() override { setWriterClock(nullptr); }
-};
+    return texts;
+}
 
-// ---------------------------------------------------------------------------
-// Period and date
-
-TEST_F(ClockTest, PeriodStartIsTheLatestUtcMidnight)
+TEST(DataWriter, PeriodStartIsTheLatestUtcMidnightAndNamesTheDate)
 {
-    struct Row {
-        wq5_time_t now;
-        wq5_time_t expected;
-        const char* what;
-    };
-    const Row rows[] = {
-        {MAR05, MAR05, "exactly midnight gives the time itself"},
-        {MAR05 - 1, MAR05 - DAY, "23:59:59 belongs to the day before"},
-        {MAR05 + DAY - 1, MAR05, "last second of the day"},
-        {MAR05 + DAY, MAR05 + DAY, "next midnight"},
-        {MAR05 + 12 * 3600 + 34, MAR05, "midday"},
-        {0, 0, "the epoch"},
-        {59, 0, "first minute of 1970"},
-    };
-    for (const Row& r : rows) {
+    const struct { wq5_time_t now, start; const char* date; } rows[] = {
+        {MAR05, MAR05, "20240305"}, {MAR05 - 1, MAR05 - DAY, "20240304"}, {MAR05 + DAY - 1, MAR05, "20240305"},
+        {MAR05 + DAY, MAR05 + DAY, "20240306"}, {0, 0, "19700101"}, {59, 0, "19700101"},
+        {946684800 + 59 * DAY + 7, 946684800 + 59 * DAY, "20000229"}};
+    for (const auto& r : rows) {
         g_now = r.now;
-        EXPECT_EQ(calcPeriodStart(DAY), r.expected) << r.what;
+        std::string date = "keep";
+        time2str(r.now, date);
+        EXPECT_EQ(r.start, calcPeriodStart(DAY)) << "now " << r.now;
+        EXPECT_EQ(r.date, date) << "now " << r.now;
+    }
+    for (const wq5_time_t t : {INT64_MAX, wq5_time_t(40000000000000000)}) {  // no date, or a year too long
+        std::string date = "keep";
+        time2str(t, date);
+        EXPECT_EQ("keep", date) << t;
     }
 }
 
-TEST(Time2Str, UtcDateOrOutputUntouched)
+TEST(ParseSeq, NumberOfTheNameOrZero)
 {
-    struct Row {
-        wq5_time_t t;
-        const char* expected;
-        const char* what;
-    };
-    const Row rows[] = {
-        {MAR05, "20240305", "midnight"},
-        {MAR05 - 1, "20240304", "one second before"},
-        {MAR05 + DAY - 1, "20240305", "end of the day"},
-        {0, "19700101", "epoch"},
-        {946684800 + 59 * DAY, "20000229", "leap day 2000"},
-        {INT64_MAX, "keep", "cannot be broken down"},
-        // Year about 1.27e9: ten digits do not fit the 13-character buffer.
-        {40000000000000000LL, "keep", "year too long for the buffer"},
-    };
-    for (const Row& r : rows) {
-        std::string out = "keep";
-        time2str(r.t, out);
-        EXPECT_EQ(out, r.expected) << r.what << " t=" << r.t;
-    }
-}
-
-// ---------------------------------------------------------------------------
-// Sequence numbers
-
-TEST(ParseSeq, NamesThatCarryANumber)
-{
-    struct Row {
-        const char* path;
-        int expected;
-    };
-    const Row rows[] = {
-        {"log/20240305.12.wq5", 12},
-        {"log/20240305.007.wq5", 7},
-        {"log/20240305.1.wq5", 1},
-        {"20240305.5.wq5", 5},
-        {"/abs/dir.d/20240305.3.wq5", 3},
-        {"log/anything.9.wq5", 9},
-        {"log/20240305.2147483647.wq5", INT_MAX},
-        {"log/20240305.000000000000000000042.wq5", 42},
-    };
-    for (const Row& r : rows) {
+    const struct { const char* path; int seq; } rows[] = {
+        {"log/20240305.12.wq5", 12}, {"log/20240305.007.wq5", 7}, {"20240305.5.wq5", 5}, {"/a/dir.d/20240305.3.wq5", 3},
+        {"log/anything.9.wq5", 9}, {"log/20240305.2147483647.wq5", INT_MAX},
+        {"log/20240305.000000000000000000042.wq5", 42}, {"log/20240305.wq5", 0}, {"log/20240305.1.2.wq5", 0},
+        {"log/20240305..wq5", 0}, {"log/20240305.1a.wq5", 0}, {"log/20240305.3.log", 0}, {"log/20240305.3.WQ5", 0},
+        {"log/20240305.3.wq5.bak", 0}, {"log/20240305.3.wq", 0}, {"log/20240305.3.", 0}, {"log/20240305.3", 0},
+        {"log/20240305", 0}, {"log.d/20240305", 0}, {"log/20240305.-1.wq5", 0}, {"log/20240305.+1.wq5", 0},
+        {"log/20240305. 1.wq5", 0}, {"log/20240305.2147483648.wq5", 0}, {"log/20240305.99999999999.wq5", 0},
+        {"", 0}, {"wq5", 0}, {".wq5", 0}};
+    for (const auto& r : rows) {
         std::string path = r.path;
-        EXPECT_EQ(parseSeq(&path[0], "wq5"), r.expected) << r.path;
-        EXPECT_EQ(path, r.path) << "not restored: " << r.path;
+        EXPECT_EQ(r.seq, parseSeq(&path[0], "wq5")) << "<" << r.path << ">";
+        EXPECT_EQ(r.path, path) << "not restored";
     }
 }
 
-TEST(ParseSeq, NamesWithoutANumberGiveZero)
+TEST(LogfileName, PicksTheDaysLatestFileOrTheNextNumber)
 {
-    const char* rows[] = {
-        "log/20240305.wq5",             // unnumbered
-        "log/20240305.1.2.wq5",         // two numbers
-        "log/20240305..wq5",            // no digit
-        "log/20240305.1a.wq5",          // not only digits
-        "log/20240305.3.log",           // other suffix
-        "log/20240305.3.WQ5",           // suffix differs in case
-        "log/20240305.3.wq5.bak",       // suffix not last
-        "log/20240305.3.wq",            // suffix cut short
-        "log/20240305.3.",              // nothing after the second dot
-        "log/20240305.3",               // no second dot
-        "log/20240305",                 // no dot at all
-        "log.d/20240305",               // dot only in the directory
-        "log/20240305.-1.wq5",          // sign
-        "log/20240305.+1.wq5",          // sign
-        "log/20240305. 1.wq5",          // blank
-        "log/20240305.2147483648.wq5",  // one past INT_MAX
-        "log/20240305.99999999999.wq5", // far past INT_MAX
-        "",                             // empty
-        "wq5",                          // suffix alone
-        ".wq5",                         // dot and suffix
-    };
-    for (const char* name : rows) {
-        std::string path = name;
-        EXPECT_EQ(parseSeq(&path[0], "wq5"), 0) << "'" << name << "'";
-        EXPECT_EQ(path, name) << "not restored: " << name;
-    }
-}
-
-TEST(ParseSeq, TracesEachStep)
-{
-    TraceCapture capture(ALL_CLASSES);
-    char path[] = "log/20240305.12.wq5";
-    ASSERT_EQ(parseSeq(path, "wq5"), 12);
-
-    EXPECT_EQ(capture.count("Parsing: log/20240305.12.wq5"), 1);
-    EXPECT_EQ(capture.count("Found start: 12.wq5"), 1);
-    char boundaries[128];
-    snprintf(boundaries, sizeof boundaries, "Boundaries %lx<1> %lx<",
-             static_cast<unsigned long>(reinterpret_cast<uintptr_t>(path + 13)),
-             static_cast<unsigned long>(reinterpret_cast<uintptr_t>(path + 15)));
-    EXPECT_TRUE(traced(capture, boundaries)) << boundaries;
-    EXPECT_EQ(capture.count("End trimmed: 12"), 1);
-    EXPECT_EQ(capture.count("Sequence: 12"), 1);
-
-    EXPECT_LT(capture.indexOf("Parsing: log/20240305.12.wq5"), capture.indexOf("Found start: 12.wq5"));
-    EXPECT_LT(capture.indexOf("End trimmed: 12"), capture.indexOf("Sequence: 12"));
-}
-
-TEST(ParseSeq, UnnumberedNameTracesOnlyUpToTheStart)
-{
-    TraceCapture capture(ALL_CLASSES);
-    char path[] = "log/20240305.wq5";
-    EXPECT_EQ(parseSeq(path, "wq5"), 0);
-    EXPECT_EQ(capture.count("Parsing: log/20240305.wq5"), 1);
-    EXPECT_EQ(capture.count("Found start: wq5"), 1);
-    EXPECT_FALSE(traced(capture, "Sequence:"));
-}
-
-// ---------------------------------------------------------------------------
-// Naming
-
-struct ExistingFile {
-    const char* name;
-    int64_t size;
-};
-
-struct NamingRow {
-    const char* what;
-    std::vector<ExistingFile> files;
-    int64_t limitBytes;  // 0 = no limit
-    const char* expected;
-};
-
-TEST(GetLogfileName, PicksTheDaysLatestFileOrTheNextNumber)
-{
-    const NamingRow rows[] = {
-        {"no file of the day", {}, 100, "20240305.wq5"},
-        {"unnumbered within the limit", {{"20240305.wq5", 50}}, 100, "20240305.wq5"},
-        {"unnumbered exactly at the limit", {{"20240305.wq5", 100}}, 100, "20240305.wq5"},
-        {"unnumbered over the limit", {{"20240305.wq5", 101}}, 100, "20240305.1.wq5"},
-        {"unnumbered large, no limit", {{"20240305.wq5", 1 << 20}}, 0, "20240305.wq5"},
-        {"1 and 3, 3 within", {{"20240305.wq5", 101}, {"20240305.1.wq5", 101}, {"20240305.3.wq5", 10}}, 100,
-         "20240305.3.wq5"},
-        {"1 and 3, 3 over", {{"20240305.1.wq5", 101}, {"20240305.3.wq5", 101}}, 100, "20240305.4.wq5"},
-        {"numbered large, no limit", {{"20240305.2.wq5", 1 << 20}}, 0, "20240305.2.wq5"},
-        {"leading zeros", {{"20240305.007.wq5", 10}}, 100, "20240305.7.wq5"},
-        {"other days never count", {{"20240304.5.wq5", 10}, {"20240306.7.wq5", 10}}, 100, "20240305.wq5"},
-        {"backup not matched", {{"20240305.9.wq5.bak", 10}}, 100, "20240305.wq5"},
-        {"malformed names count as 0", {{"20240305.1.2.wq5", 10}, {"20240305-old.wq5", 10}}, 100, "20240305.wq5"},
-        {"number past INT_MAX counts as 0", {{"20240305.2147483648.wq5", 10}}, 100, "20240305.wq5"},
-        {"INT_MAX over the limit has no successor", {{"20240305.2147483647.wq5", 101}}, 100,
-         "20240305.2147483647.wq5"},
-        {"next number's size is not looked at", {{"20240305.wq5", 101}, {"20240305.1.wq5", 101}}, 100,
-         "20240305.2.wq5"},
-    };
-    for (const NamingRow& r : rows) {
+    const struct { const char* what; Files files; long mb; int64_t bytes; const char* expected; } rows[] = {
+        {"no file of the day", {}, 0, 100, "20240305.wq5"},
+        {"unnumbered within the limit", {{"20240305.wq5", 50}}, 0, 100, "20240305.wq5"},
+        {"unnumbered exactly at the limit", {{"20240305.wq5", 100}}, 0, 100, "20240305.wq5"},
+        {"unnumbered over the limit", {{"20240305.wq5", 101}}, 0, 100, "20240305.1.wq5"},
+        {"no limit", {{"20240305.wq5", MB}, {"20240305.2.wq5", MB}}, 0, 0, "20240305.2.wq5"},
+        {"1 and 3, 3 within", {{"20240305.1.wq5", 101}, {"20240305.3.wq5", 10}}, 0, 100, "20240305.3.wq5"},
+        {"1 and 3, 3 over: gaps stay", {{"20240305.1.wq5", 101}, {"20240305.3.wq5", 101}}, 0, 100, "20240305.4.wq5"},
+        {"next number's size unread", {{"20240305.wq5", 101}, {"20240305.1.wq5", 101}}, 0, 100, "20240305.2.wq5"},
+        {"leading zeros", {{"20240305.007.wq5", 10}}, 0, 100, "20240305.7.wq5"},
+        {"other days never count", {{"20240304.5.wq5", 10}, {"20240306.7.wq5", 10}}, 0, 100, "20240305.wq5"},
+        {"malformed names count as 0", {{"20240305.1.2.wq5", 10}, {"20240305.9.wq5.bak", 10}}, 0, 100, "20240305.wq5"},
+        {"a number past INT_MAX counts as 0", {{"20240305.2147483648.wq5", 10}}, 0, 100, "20240305.wq5"},
+        {"INT_MAX has no successor", {{"20240305.2147483647.wq5", 101}}, 0, 100, "20240305.2147483647.wq5"},
+        {"1 MB, one byte over", {{"20240305.wq5", MB + 1}}, 1, 0, "20240305.1.wq5"},
+        {"1 MB exactly", {{"20240305.wq5", MB}}, 1, 0, "20240305.wq5"},
+        {"2048 MB, one byte over 2 GiB", {{"20240305.wq5", 2048 * MB + 1}}, 2048, 0, "20240305.1.wq5"},
+        {"4096 MB, a 3 GiB file", {{"20240305.wq5", 3072 * MB}}, 4096, 0, "20240305.wq5"},
+        {"a huge limit saturates", {{"20240305.wq5", 3072 * MB}}, LONG_MAX, 0, "20240305.wq5"},
+        {"a negative limit is none", {{"20240305.wq5", 3072 * MB}}, -1, 0, "20240305.wq5"}};
+    for (const auto& r : rows) {
         TempDir dir;
-        for (const ExistingFile& f : r.files)
-            makeFile(dir / f.name, f.size);
-        DataWriter writer(dir.path(), "wq5", 7, 0);
-        writer.setMaxSizeBytes(r.limitBytes);
-        std::string name;
-        writer.getLogfileName(MAR05, name);
-        EXPECT_EQ(name, dir / r.expected) << r.what;
+        makeFiles(dir, r.files);
+        for (const std::string& spelling : {dir.path, dir.path + "/"}) {
+            DataWriter writer(spelling, "wq5", 7, r.mb);
+            if (r.bytes != 0)
+                writer.setMaxSizeBytes(r.bytes);
+            std::string name;
+            writer.getLogfileName(MAR05, name);
+            EXPECT_EQ(dir / r.expected, name) << r.what << ", directory <" << spelling << ">";
+        }
     }
 }
 
-TEST(GetLogfileName, LimitInMegabytesIsSixtyFourBit)
+TEST(LogfileName, NamingAndRetentionTraceEveryStep)
 {
-    const int64_t MB = 1048576;
-    const int64_t GB = 1024 * MB;
-    struct Row {
-        const char* what;
-        long limitMb;
-        int64_t size;
-        const char* expected;
-    };
-    const Row rows[] = {
-        {"1 MB, one byte over", 1, MB + 1, "20240305.1.wq5"},
-        {"1 MB, exactly", 1, MB, "20240305.wq5"},
-        {"2048 MB, one byte over 2 GiB", 2048, 2 * GB + 1, "20240305.1.wq5"},
-        {"4096 MB, 3 GiB file", 4096, 3 * GB, "20240305.wq5"},
-        {"limit saturates instead of wrapping", LONG_MAX, 3 * GB, "20240305.wq5"},
-        {"negative limit is none", -1, 3 * GB, "20240305.wq5"},
-    };
-    for (const Row& r : rows) {
+    TempDir dir;
+    makeFiles(dir, {{"20240226.wq5", 1}, {"20240305.1.wq5", 0}, {"20240305.3.wq5", 0}});
+    ASSERT_EQ(0, mkdir((dir / "20240101.wq5").c_str(), 0755));
+    TraceCapture capture(ALL_CLASSES);
+    char numbered[] = "log/20240305.12.wq5", unnumbered[] = "log/20240305.wq5";
+    parseSeq(numbered, "wq5");
+    parseSeq(unnumbered, "wq5");
+    char boundaries[80];
+    snprintf(boundaries, sizeof(boundaries), "Boundaries %lx<1> %lx<\\x00>",
+             static_cast<unsigned long>(reinterpret_cast<uintptr_t>(numbered + 13)),
+             static_cast<unsigned long>(reinterpret_cast<uintptr_t>(numbered + 15)));
+    EXPECT_EQ((std::vector<std::string>{"Parsing: log/20240305.12.wq5", "Found start: 12.wq5", boundaries,
+                                        "End trimmed: 12", "Sequence: 12", "Parsing: log/20240305.wq5",
+                                        "Found start: wq5"}),
+              traced(capture, "parseSeq"));
+
+    std::string name;
+    DataWriter(dir.path, "wq5", 7, 0).getLogfileName(MAR05, name);
+    DataWriter(dir / "absent", "wq5", 7, 0).getLogfileName(MAR05, name);
+    EXPECT_EQ((std::vector<std::string>{"Found 2 logs for this period", "Latest sequence number: 3",
+                                        "Logfile: " + dir / "20240305.3.wq5", "Latest sequence number: 0",
+                                        "Logfile: " + dir / "absent/20240305.wq5"}),
+              traced(capture, "DataWriter::getLogfileName"));
+    EXPECT_FALSE(fs::exists(dir / "absent")) << "naming creates no directory";
+
+    DataWriter(dir.path, "wq5", 7, 0).deleteOldFiles(MAR05);
+    DataWriter(dir / "absent", "wq5", 7, 0).deleteOldFiles(MAR05);  // quietly nothing
+    std::vector<std::string> retention = traced(capture, "DataWriter::deleteOldFiles");
+    std::sort(retention.begin() + std::min<size_t>(1, retention.size()), retention.end());  // directory order
+    EXPECT_EQ((std::vector<std::string>{"Threshold <20240227>", "Checking <20240226.wq5>", "Checking <20240305.1.wq5>",
+                                        "Checking <20240305.3.wq5>", "Removing <" + dir / "20240226.wq5" + ">"}),
+              retention);
+}
+
+TEST(DeleteOldFiles, RemovesLogFilesWhoseNameSortsBeforeTheThresholdDay)
+{
+    // Besides: a directory 20240101.wq5, a link 20240102.wq5 to target.txt, a dangling link 20240103.wq5.
+    const Files files = {{"20231231.wq5", 1}, {"20240226.wq5", 1},    {"20240226.4.wq5", 1},  {"20240227.wq5", 1},
+                         {"20240227.3.wq5", 1}, {"20240303.wq5", 1},  {"20240304.wq5", 1},    {"20240304.1.wq5", 1},
+                         {"20240305.wq5", 1},   {"20240226.wq5.gz", 1}, {"20240226.log", 1}, {"20240226", 1},
+                         {"notes.wq5", 1},      {"0.wq5", 1},         {"20240226-old.wq5", 1}, {".wq5", 1},
+                         {"target.txt", 1}};
+    const std::set<std::string> week = {"20231231.wq5", "20240226.wq5", "20240226.4.wq5", "0.wq5",
+                                        "20240226-old.wq5", ".wq5", "20240102.wq5"};
+    std::set<std::string> day = week;
+    day.insert({"20240227.wq5", "20240227.3.wq5", "20240303.wq5"});
+    const struct { long keepDays; std::set<std::string> removed; } rows[] = {
+        {7, week}, {1, day}, {0, {}}, {-1, {}}, {LONG_MAX, {}},  // LONG_MAX days: a threshold out of range
+        {44643, {"0.wq5", ".wq5"}}};                            // threshold in December 1901
+    for (const auto& r : rows) {
         TempDir dir;
-        makeFile(dir / "20240305.wq5", r.size);
-        DataWriter writer(dir.path(), "wq5", 7, r.limitMb);
-        std::string name;
-        writer.getLogfileName(MAR05, name);
-        EXPECT_EQ(name, dir / r.expected) << r.what;
+        makeFiles(dir, files);
+        ASSERT_EQ(0, mkdir((dir / "20240101.wq5").c_str(), 0755));
+        ASSERT_EQ(0, symlink("target.txt", (dir / "20240102.wq5").c_str()));
+        ASSERT_EQ(0, symlink("nowhere.txt", (dir / "20240103.wq5").c_str()));
+        std::set<std::string> expected = {"20240101.wq5", "20240102.wq5", "20240103.wq5"}, left;
+        for (const auto& f : files)
+            expected.insert(f.first);
+        for (const std::string& name : r.removed)
+            expected.erase(name);
+        DataWriter(dir.path, "wq5", r.keepDays, 0).deleteOldFiles(MAR05);
+        for (const auto& f : listDir(dir.path))
+            left.insert(f.first);
+        EXPECT_EQ(expected, left) << "keep " << r.keepDays << " days";
     }
 }
 
-TEST(GetLogfileName, TrailingSlashMakesNoDifference)
+TEST(DataWriter, OpensRollsOverAndReopensAsTheDayAndTheFileRequire)
 {
-    TempDir dir;
-    makeFile(dir / "20240305.wq5", 0);
-    makeFile(dir / "20240305.2.wq5", 0);
-    DataWriter bare(dir.path(), "wq5", 7, 0);
-    DataWriter slashed(dir.path() + "/", "wq5", 7, 0);
-    std::string a, b;
-    bare.getLogfileName(MAR05, a);
-    slashed.getLogfileName(MAR05, b);
-    EXPECT_EQ(a, dir / "20240305.2.wq5");
-    EXPECT_EQ(b, a);
-}
-
-TEST(GetLogfileName, MissingDirectoryGivesTheUnnumberedName)
-{
-    TempDir dir;
-    TraceCapture capture(ALL_CLASSES);
-    DataWriter writer(dir / "absent", "wq5", 7, 1);
-    std::string name;
-    writer.getLogfileName(MAR05, name);
-    EXPECT_EQ(name, dir / "absent/20240305.wq5");
-    EXPECT_FALSE(traced(capture, "logs for this period"));
-    EXPECT_EQ(capture.count("Latest sequence number: 0"), 1);
-    EXPECT_FALSE(fs::exists(dir / "absent")) << "the directory must not be created";
-}
-
-TEST(GetLogfileName, TracesCountLatestAndName)
-{
-    TempDir dir;
-    makeFile(dir / "20240305.wq5", 0);
-    makeFile(dir / "20240305.1.wq5", 0);
-    makeFile(dir / "20240305.3.wq5", 0);
-    DataWriter writer(dir.path(), "wq5", 7, 0);
-    TraceCapture capture(ALL_CLASSES);
-    std::string name;
-    writer.getLogfileName(MAR05, name);
-
-    const std::string logfile = "Logfile: " + dir / "20240305.3.wq5";
-    EXPECT_EQ(capture.count("Found 3 logs for this period"), 1);
-    EXPECT_EQ(capture.count("Latest sequence number: 3"), 1);
-    EXPECT_EQ(capture.count(logfile), 1);
-    EXPECT_LT(capture.indexOf("Found 3 logs for this period"), capture.indexOf("Latest sequence number: 3"));
-    EXPECT_LT(capture.indexOf("Latest sequence number: 3"), capture.indexOf(logfile));
-}
-
-TEST(GetLogfileName, EmptyDirectoryMeansWorkingDirectory)
-{
-    DataWriter writer("", "wq5", 7, 0);
-    std::string name;
-    // A date far from today: nothing in the working directory matches.
-    writer.getLogfileName(0, name);
-    EXPECT_EQ(name, "./19700101.wq5");
-}
-
-// ---------------------------------------------------------------------------
-// Retention
-
-// Every file of the retention table, created afresh for each row.
-const char* const RETENTION_FILES[] = {
-    "20231231.wq5",      "20240226.wq5",   "20240226.4.wq5", "20240227.wq5",     "20240227.3.wq5",
-    "20240303.wq5",      "20240304.wq5",   "20240304.1.wq5", "20240305.wq5",     "20240226.wq5.gz",
-    "20240226.log",      "20240226",       "notes.wq5",      "0.wq5",            "20240226-old.wq5",
-    ".wq5",              "target.txt",
-};
-// Made as a subdirectory, a link to target.txt and a dangling link.
-const char* const RETENTION_SUBDIR = "20240101.wq5";
-const char* const RETENTION_LINK = "20240102.wq5";
-const char* const RETENTION_DANGLING = "20240103.wq5";
-
-struct RetentionRow {
-    const char* what;
-    long keepDays;
-    std::set<std::string> survivors;
-};
-
-TEST(DeleteOldFiles, KeepsTheConfiguredDaysByName)
-{
-    // Expected survivors, by hand: a file goes when the threshold date sorts
-    // after its whole name and its last extension is exactly "wq5".
-    const std::set<std::string> all = {
-        "20231231.wq5",  "20240226.wq5", "20240226.4.wq5",  "20240227.wq5",     "20240227.3.wq5", "20240303.wq5",
-        "20240304.wq5",  "20240304.1.wq5", "20240305.wq5",  "20240226.wq5.gz",  "20240226.log",   "20240226",
-        "notes.wq5",     "0.wq5",        "20240226-old.wq5", ".wq5",            "target.txt",     "20240101.wq5",
-        "20240102.wq5",  "20240103.wq5",
-    };
-    const RetentionRow rows[] = {
-        {"7 days: threshold 20240227",
-         7,
-         {"20240227.wq5", "20240227.3.wq5", "20240303.wq5", "20240304.wq5", "20240304.1.wq5", "20240305.wq5",
-          "20240226.wq5.gz", "20240226.log", "20240226", "notes.wq5", "target.txt", "20240101.wq5",
-          "20240103.wq5"}},
-        {"1 day: threshold 20240304",
-         1,
-         {"20240304.wq5", "20240304.1.wq5", "20240305.wq5", "20240226.wq5.gz", "20240226.log", "20240226",
-          "notes.wq5", "target.txt", "20240101.wq5", "20240103.wq5"}},
-        {"0 days keeps everything", 0, all},
-        {"-1 days keeps everything", -1, all},
-        // 44643 days before 2024 is late 1901/early 1902: every dated name
-        // stays; only names sorting before "19" go.
-        {"44643 days: threshold in 1901/1902",
-         44643,
-         {"20231231.wq5", "20240226.wq5", "20240226.4.wq5", "20240227.wq5", "20240227.3.wq5", "20240303.wq5",
-          "20240304.wq5", "20240304.1.wq5", "20240305.wq5", "20240226.wq5.gz", "20240226.log", "20240226",
-          "notes.wq5", "20240226-old.wq5", "target.txt", "20240101.wq5", "20240102.wq5", "20240103.wq5"}},
-        {"threshold out of range keeps everything", LONG_MAX, all},
-    };
-    for (const RetentionRow& r : rows) {
+    struct Step { wq5_time_t at; std::string record; bool removeFileFirst = false; };
+    const struct { const char* what; Files before; long mb; int64_t bytes; std::vector<Step> steps; Files after;
+                   int opens; } rows[] = {
+        {"the first record opens the day's file and prunes", {{"20240101.wq5", 1}}, 0, 0,
+         {{NOON, "first\n"}, {NOON, "second\n"}}, {{"20240305.wq5", 13}}, 1},
+        {"a restart appends to the day's latest file", {{"20240305.wq5", 0}, {"20240305.2.wq5", 7}}, 1, 0,
+         {{NOON, "after\n"}}, {{"20240305.wq5", 0}, {"20240305.2.wq5", 13}}, 1},
+        {"midnight starts the next day's file and prunes again", {{"20240227.wq5", 1}}, 0, 0,
+         {{MAR05 + DAY - 1, "late\n"}, {MAR05 + DAY, "early!\n"}}, {{"20240305.wq5", 5}, {"20240306.wq5", 7}}, 2},
+        {"a clock set back keeps the file; a forced reopen takes the earlier date", {}, 0, 10,
+         {{MAR05 + DAY + 10, "a\n"}, {MAR05 + DAY - 10, "b\n"}, {MAR05 + DAY - 10, "0123456789\n"},
+          {MAR05 + DAY - 10, "c\n"}}, {{"20240306.wq5", 15}, {"20240305.wq5", 2}}, 2},
+        {"1 MB: the record passing the limit stays, the next starts number 1", {{"20240305.wq5", MB - 10}}, 1, 0,
+         {{NOON, std::string(20, 'x')}, {NOON, "next\n"}}, {{"20240305.wq5", MB + 10}, {"20240305.1.wq5", 5}}, 2},
+        {"a file of exactly the limit stays in use", {{"20240305.wq5", MB - 5}}, 1, 0,
+         {{NOON, "abcd\n"}, {NOON, "more\n"}}, {{"20240305.wq5", MB + 5}}, 1},
+        {"no limit: never rolls, grows past 2 GiB", {{"20240305.wq5", 3072 * MB}}, 0, 0,
+         {{NOON, "one\n"}, {NOON, "two\n"}}, {{"20240305.wq5", 3072 * MB + 8}}, 1},
+        {"numbers 1 and 3: 3 goes on, then 4", {{"20240305.1.wq5", 100}, {"20240305.3.wq5", 95}}, 0, 100,
+         {{NOON, "12345678\n"}, {NOON, "four\n"}},
+         {{"20240305.1.wq5", 100}, {"20240305.3.wq5", 104}, {"20240305.4.wq5", 5}}, 2},
+        {"the first record at the epoch", {}, 0, 0, {{5, "a\n"}}, {{"19700101.wq5", 2}}, 1},
+        {"a removed file is reopened", {}, 0, 0, {{NOON, "one\n"}, {NOON + 1, "two!\n", true}},
+         {{"20240305.wq5", 5}}, 2},
+        {"a removed file is reopened, under a limit", {}, 1, 0, {{NOON, "one\n"}, {NOON, "two!\n", true}},
+         {{"20240305.wq5", 5}}, 2}};
+    for (const auto& r : rows) {
         TempDir dir;
-        for (const char* name : RETENTION_FILES)
-            makeFile(dir / name, 1);
-        ASSERT_EQ(mkdir((dir / RETENTION_SUBDIR).c_str(), 0755), 0);
-        ASSERT_EQ(symlink("target.txt", (dir / RETENTION_LINK).c_str()), 0);
-        ASSERT_EQ(symlink("nowhere.txt", (dir / RETENTION_DANGLING).c_str()), 0);
-
-        DataWriter writer(dir.path(), "wq5", r.keepDays, 0);
-        writer.deleteOldFiles(MAR05);
-        EXPECT_EQ(listDir(dir.path()), r.survivors) << r.what;
+        makeFiles(dir, r.before);
+        DataWriter writer(dir.path, "wq5", 7, r.mb);
+        if (r.bytes != 0)
+            writer.setMaxSizeBytes(r.bytes);
+        TraceCapture capture(ALL_CLASSES);
+        for (const Step& s : r.steps) {
+            ASSERT_TRUE(!s.removeFileFirst || unlink((dir / "20240305.wq5").c_str()) == 0);
+            g_now = s.at;
+            EXPECT_TRUE(writeRecord(writer, s.record)) << r.what << ": " << s.record;
+        }
+        EXPECT_EQ(r.after, listDir(dir.path)) << r.what;
+        EXPECT_EQ(r.opens, capture.count("opened successfully.")) << r.what;
     }
 }
 
-TEST(DeleteOldFiles, TracesThresholdCheckedNamesAndRemovedPaths)
+// Records are dropped while the log directory cannot be used, with one error
+// message for the run of failures; the first record after `repair` gets through.
+void expectDropsUntilRepaired(DataWriter& writer, const std::string& file, const std::function<void()>& repair)
 {
-    TempDir dir;
-    makeFile(dir / "20240226.wq5", 1);
-    makeFile(dir / "20240305.wq5", 1);
-    makeFile(dir / "notes.txt", 1);
-    ASSERT_EQ(mkdir((dir / "20240101.wq5").c_str(), 0755), 0);
-    DataWriter writer(dir.path(), "wq5", 7, 0);
     TraceCapture capture(ALL_CLASSES);
-    writer.deleteOldFiles(MAR05);
-
-    EXPECT_EQ(capture.count("Threshold <20240227>"), 1);
-    EXPECT_EQ(capture.count("Checking <20240226.wq5>"), 1);
-    EXPECT_EQ(capture.count("Checking <20240305.wq5>"), 1);
-    EXPECT_EQ(capture.count("Checking <notes.txt>"), 1);
-    EXPECT_EQ(capture.count("Checking <20240101.wq5>"), 0) << "directories are not checked";
-    EXPECT_EQ(capture.count("Removing <" + dir / "20240226.wq5" + ">"), 1);
-    EXPECT_EQ(capture.count("Removing <" + dir / "20240305.wq5" + ">"), 0);
-}
-
-TEST(DeleteOldFiles, MissingDirectoryOrNoRetentionDoesNothingQuietly)
-{
-    TempDir dir;
-    TraceCapture capture(ALL_CLASSES);
-    DataWriter missing(dir / "absent", "wq5", 7, 0);
-    missing.deleteOldFiles(MAR05);
-    makeFile(dir / "20200101.wq5", 1);
-    DataWriter disabled(dir.path(), "wq5", 0, 0);
-    disabled.deleteOldFiles(MAR05);
-
-    EXPECT_TRUE(capture.lines().empty()) << capture.lines().front();
-    EXPECT_TRUE(fs::exists(dir / "20200101.wq5"));
-    EXPECT_FALSE(fs::exists(dir / "absent"));
-}
-
-// ---------------------------------------------------------------------------
-// Writer: opening and rollover
-
-TEST_F(ClockTest, FirstRecordOpensTheDaysFileAndPrunesOnce)
-{
-    TempDir dir;
-    makeFile(dir / "20240101.wq5", 1);
-    DataWriter writer(dir.path(), "wq5", 7, 0);
-    TraceCapture capture(ALL_CLASSES);
-
-    EXPECT_TRUE(fs::exists(dir / "20240101.wq5")) << "the constructor opens and prunes nothing";
-    ASSERT_TRUE(writeRecord(writer, "first\n"));
-    ASSERT_TRUE(writeRecord(writer, "second\n"));
-
-    EXPECT_EQ(readFile(dir / "20240305.wq5"), "first\nsecond\n");
-    EXPECT_FALSE(fs::exists(dir / "20240101.wq5"));
-    EXPECT_EQ(capture.count("Threshold <20240227>"), 1) << "pruned once";
-    EXPECT_EQ(capture.count("Data file <" + dir / "20240305.wq5" + "> opened successfully."), 1);
-}
-
-TEST_F(ClockTest, RestartOnTheSameDayAppendsToTheLatestFile)
-{
-    TempDir dir;
-    makeFile(dir / "20240305.wq5", 0);
-    {
-        std::ofstream(dir / "20240305.2.wq5") << "before\n";
-    }
-    DataWriter writer(dir.path(), "wq5", 7, 1);
-    ASSERT_TRUE(writeRecord(writer, "after\n"));
-    EXPECT_EQ(readFile(dir / "20240305.2.wq5"), "before\nafter\n");
-}
-
-TEST_F(ClockTest, MidnightStartsTheNextDaysFile)
-{
-    TempDir dir;
-    DataWriter writer(dir.path(), "wq5", 7, 0);
-    TraceCapture capture(ALL_CLASSES);
-
-    g_now = MAR05 + DAY - 1;  // 2024-03-05 23:59:59
-    ASSERT_TRUE(writeRecord(writer, "late\n"));
-    g_now = MAR05 + DAY;  // 2024-03-06 00:00:00
-    ASSERT_TRUE(writeRecord(writer, "early\n"));
-
-    EXPECT_EQ(readFile(dir / "20240305.wq5"), "late\n");
-    EXPECT_EQ(readFile(dir / "20240306.wq5"), "early\n");
-    EXPECT_EQ(listDir(dir.path()), (std::set<std::string>{"20240305.wq5", "20240306.wq5"}));
-    EXPECT_EQ(capture.count("Threshold <20240227>"), 1);
-    EXPECT_EQ(capture.count("Threshold <20240228>"), 1);
-}
-
-TEST_F(ClockTest, ClockSetBackKeepsTheCurrentFile)
-{
-    TempDir dir;
-    DataWriter writer(dir.path(), "wq5", 7, 0);
-    writer.setMaxSizeBytes(10);
-
-    g_now = MAR05 + DAY + 10;  // 2024-03-06 00:00:10
-    ASSERT_TRUE(writeRecord(writer, "a\n"));
-    g_now = MAR05 + DAY - 10;  // back to 2024-03-05 23:59:50
-    ASSERT_TRUE(writeRecord(writer, "b\n"));
-    EXPECT_EQ(readFile(dir / "20240306.wq5"), "a\nb\n");
-    EXPECT_FALSE(fs::exists(dir / "20240305.wq5"));
-
-    // The limit forces a reopen while the clock is back: the new file
-    // carries the earlier date.
-    ASSERT_TRUE(writeRecord(writer, "0123456789\n"));
-    ASSERT_TRUE(writeRecord(writer, "c\n"));
-    EXPECT_EQ(readFile(dir / "20240306.wq5"), "a\nb\n0123456789\n");
-    EXPECT_EQ(readFile(dir / "20240305.wq5"), "c\n");
-}
-
-TEST_F(ClockTest, OneMegabyteLimitRollsAfterTheRecordThatPassesIt)
-{
-    const int64_t LIMIT = 1048576;
-    TempDir dir;
-    makeFile(dir / "20240305.wq5", LIMIT - 10);
-    DataWriter writer(dir.path(), "wq5", 7, 1);
-
-    const std::string record(20, 'x');
-    ASSERT_TRUE(writeRecord(writer, record));  // passes the limit, still here
-    EXPECT_EQ(fileSize(dir / "20240305.wq5"), LIMIT + 10);
-    ASSERT_TRUE(writeRecord(writer, "next\n"));
-    EXPECT_EQ(readFile(dir / "20240305.1.wq5"), "next\n");
-    EXPECT_EQ(fileSize(dir / "20240305.wq5"), LIMIT + 10);
-}
-
-TEST_F(ClockTest, FileOfExactlyTheLimitStaysInUse)
-{
-    const int64_t LIMIT = 1048576;
-    TempDir dir;
-    makeFile(dir / "20240305.wq5", LIMIT - 5);
-    DataWriter writer(dir.path(), "wq5", 7, 1);
-
-    ASSERT_TRUE(writeRecord(writer, "abcd\n"));
-    EXPECT_EQ(fileSize(dir / "20240305.wq5"), LIMIT);
-    ASSERT_TRUE(writeRecord(writer, "more\n"));
-    EXPECT_EQ(fileSize(dir / "20240305.wq5"), LIMIT + 5);
-    EXPECT_FALSE(fs::exists(dir / "20240305.1.wq5"));
-}
-
-TEST_F(ClockTest, NoLimitNeverRollsAndFilesGrowPastTwoGigabytes)
-{
-    const int64_t SIZE = int64_t(3) << 30;
-    TempDir dir;
-    makeFile(dir / "20240305.wq5", SIZE);
-    DataWriter writer(dir.path(), "wq5", 7, 0);
-
-    ASSERT_TRUE(writeRecord(writer, "one\n"));
-    ASSERT_TRUE(writeRecord(writer, "two\n"));
-    EXPECT_EQ(fileSize(dir / "20240305.wq5"), SIZE + 8);
-    EXPECT_EQ(listDir(dir.path()), std::set<std::string>{"20240305.wq5"});
-
-    std::ifstream in(dir / "20240305.wq5", std::ios::binary);
-    in.seekg(SIZE);
-    std::string tail((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    EXPECT_EQ(tail, "one\ntwo\n");
-}
-
-TEST_F(ClockTest, NumbersOneAndThreeContinueWithThreeThenFour)
-{
-    TempDir dir;
-    makeFile(dir / "20240305.1.wq5", 100);
-    makeFile(dir / "20240305.3.wq5", 95);
-    DataWriter writer(dir.path(), "wq5", 7, 0);
-    writer.setMaxSizeBytes(100);
-
-    ASSERT_TRUE(writeRecord(writer, "12345678\n"));  // 3 reaches 104
-    ASSERT_TRUE(writeRecord(writer, "four\n"));
-    EXPECT_EQ(fileSize(dir / "20240305.3.wq5"), 104);
-    EXPECT_EQ(readFile(dir / "20240305.4.wq5"), "four\n");
-    EXPECT_FALSE(fs::exists(dir / "20240305.2.wq5")) << "gaps are not filled";
-}
-
-// ---------------------------------------------------------------------------
-// Writer: failures and recovery
-
-TEST_F(ClockTest, MissingDirectoryDropsRecordsUntilItExists)
-{
-    TempDir dir;
-    const std::string logDir = dir / "log";
-    const std::string error = "Error: Data file <" + logDir + "/20240305.wq5> cannot be opened";
-    const std::string opened = "Data file <" + logDir + "/20240305.wq5> opened successfully.";
-    DataWriter writer(logDir, "wq5", 7, 0);
-    TraceCapture capture(ALL_CLASSES);
-
-    for (int i = 0; i < 3; ++i)
-        EXPECT_FALSE(writeRecord(writer, "lost\n")) << "record " << i;
-    EXPECT_EQ(capture.count(error), 1);
-    EXPECT_FALSE(fs::exists(logDir)) << "the writer never creates the directory";
-
-    ASSERT_EQ(mkdir(logDir.c_str(), 0755), 0);
-    ASSERT_TRUE(writeRecord(writer, "kept\n"));
-    EXPECT_EQ(capture.count(opened), 1);
-    EXPECT_EQ(readFile(logDir + "/20240305.wq5"), "kept\n");
-
-    // A new run of failures is reported once again.
-    ASSERT_EQ(unlink((logDir + "/20240305.wq5").c_str()), 0);
-    ASSERT_EQ(rmdir(logDir.c_str()), 0);
-    g_now = g_now + 1;
-    EXPECT_FALSE(writeRecord(writer, "lost\n"));
-    EXPECT_FALSE(writeRecord(writer, "lost\n"));
-    EXPECT_EQ(capture.count(error), 2);
-}
-
-TEST_F(ClockTest, CheckAndOpenReturnsMinusOneOnlyForAFailedOpen)
-{
-    // Single-threaded: calling it directly stands in for the lock's call.
-    TempDir dir;
-    DataWriter missing(dir / "absent", "wq5", 7, 0);
-    EXPECT_EQ(missing.checkAndOpen(), -1);
-    EXPECT_EQ(missing.checkAndOpen(), -1) << "every record retries";
-
-    DataWriter present(dir.path(), "wq5", 7, 0);
-    EXPECT_EQ(present.checkAndOpen(), 0) << "successful open";
-    EXPECT_EQ(present.checkAndOpen(), 0) << "file already open";
-}
-
-TEST_F(ClockTest, UnwritableDirectoryDropsRecordsUntilItIsUsable)
-{
-    // The parent is a regular file: no open can succeed, root or not.
-    TempDir dir;
-    makeFile(dir / "blocker", 0);
-    const std::string logDir = dir / "blocker/log";
-    DataWriter writer(logDir, "wq5", 7, 0);
-    TraceCapture capture(ALL_CLASSES);
-
-    EXPECT_FALSE(writeRecord(writer, "lost\n"));
-    EXPECT_FALSE(writeRecord(writer, "lost\n"));
-    EXPECT_EQ(capture.count("Error: Data file <" + logDir + "/20240305.wq5> cannot be opened"), 1);
-
-    ASSERT_EQ(unlink((dir / "blocker").c_str()), 0);
-    ASSERT_EQ(mkdir((dir / "blocker").c_str(), 0755), 0);
-    ASSERT_EQ(mkdir(logDir.c_str(), 0755), 0);
-    ASSERT_TRUE(writeRecord(writer, "kept\n"));
-    EXPECT_EQ(capture.count("Data file <" + logDir + "/20240305.wq5> opened successfully."), 1);
-    EXPECT_EQ(readFile(logDir + "/20240305.wq5"), "kept\n");
-}
-
-TEST_F(ClockTest, FailedOpenRetriesAlsoWhenTheClockIsSetBack)
-{
-    TempDir dir;
-    const std::string logDir = dir / "log";
-    ASSERT_EQ(mkdir(logDir.c_str(), 0755), 0);
-    DataWriter writer(logDir, "wq5", 7, 0);
-
-    g_now = MAR05 + DAY + 10;  // 2024-03-06
-    ASSERT_TRUE(writeRecord(writer, "a\n"));
-    ASSERT_EQ(unlink((logDir + "/20240306.wq5").c_str()), 0);
-    ASSERT_EQ(rmdir(logDir.c_str()), 0);
-    g_now = MAR05 + 2 * DAY + 10;  // 2024-03-07: the new day's open fails
-    EXPECT_FALSE(writeRecord(writer, "lost\n"));
-
-    ASSERT_EQ(mkdir(logDir.c_str(), 0755), 0);
-    g_now = MAR05 + 10;  // back to 2024-03-05, before the last open day
-    ASSERT_TRUE(writeRecord(writer, "b\n"));
-    EXPECT_EQ(readFile(logDir + "/20240305.wq5"), "b\n");
-}
-
-TEST_F(ClockTest, FirstRecordAtTheEpochOpensToo)
-{
-    TempDir dir;
-    DataWriter writer(dir.path(), "wq5", 7, 0);
-    g_now = 5;
-    ASSERT_TRUE(writeRecord(writer, "a\n"));
-    EXPECT_EQ(readFile(dir / "19700101.wq5"), "a\n");
-}
-
-TEST_F(ClockTest, RemovedFileIsReopenedWithinASecond)
-{
-    TempDir dir;
-    const std::string file = dir / "20240305.wq5";
-    DataWriter writer(dir.path(), "wq5", 7, 0);
-
-    ASSERT_TRUE(writeRecord(writer, "one\n"));
-    ASSERT_EQ(unlink(file.c_str()), 0);
-    g_now = g_now + 1;
-    ASSERT_TRUE(writeRecord(writer, "two\n"));
-    EXPECT_EQ(readFile(file), "two\n");
-}
-
-TEST_F(ClockTest, RemovedFileIsReopenedAtOnceUnderALimit)
-{
-    TempDir dir;
-    const std::string file = dir / "20240305.wq5";
-    DataWriter writer(dir.path(), "wq5", 7, 1);
-
-    ASSERT_TRUE(writeRecord(writer, "one\n"));
-    ASSERT_EQ(unlink(file.c_str()), 0);
-    ASSERT_TRUE(writeRecord(writer, "two\n"));
-    EXPECT_EQ(readFile(file), "two\n");
-}
-
-TEST_F(ClockTest, RemovedDirectoryIsReportedOnceAndRecoveredFrom)
-{
-    TempDir dir;
-    const std::string logDir = dir / "log";
-    const std::string file = logDir + "/20240305.wq5";
-    ASSERT_EQ(mkdir(logDir.c_str(), 0755), 0);
-    DataWriter writer(logDir, "wq5", 7, 0);
-    TraceCapture capture(ALL_CLASSES);
-
-    ASSERT_TRUE(writeRecord(writer, "one\n"));
-    ASSERT_EQ(unlink(file.c_str()), 0);
-    ASSERT_EQ(rmdir(logDir.c_str()), 0);
     for (int i = 0; i < 3; ++i) {
         g_now = g_now + 1;
         EXPECT_FALSE(writeRecord(writer, "lost\n")) << "record " << i;
     }
-    EXPECT_EQ(capture.count("Error: Data file <" + file + "> cannot be opened"), 1);
+    EXPECT_EQ(1, capture.count("Error: Data file <" + file + "> cannot be opened"));
+    EXPECT_TRUE(traced(capture, "DataWriter::deleteOldFiles").empty()) << "retention in a missing directory is quiet";
+    EXPECT_FALSE(fs::exists(fs::path(file).parent_path())) << "the writer creates no directory";
+    repair();
+    EXPECT_TRUE(writeRecord(writer, "kept\n"));
+    EXPECT_EQ(1, capture.count("Data file <" + file + "> opened successfully."));
+    EXPECT_EQ("kept\n", readFile(file));
+}
 
-    ASSERT_EQ(mkdir(logDir.c_str(), 0755), 0);
-    ASSERT_TRUE(writeRecord(writer, "back\n"));
-    EXPECT_EQ(capture.count("Data file <" + file + "> opened successfully."), 2);
-    EXPECT_EQ(readFile(file), "back\n");
+TEST(DataWriter, MissingRemovedOrUnusableDirectoryDropsRecordsUntilItIsBack)
+{
+    TempDir dir;
+    const std::string log = dir / "log", file = log + "/20240305.wq5";
+    g_now = NOON;
+    DataWriter writer(log, "wq5", 7, 0);
+    expectDropsUntilRepaired(writer, file, [&] { ASSERT_EQ(0, mkdir(log.c_str(), 0755)); });
+    EXPECT_EQ(0, writer.checkAndOpen()) << "the file is open";
+    ASSERT_EQ(0, unlink(file.c_str()));
+    ASSERT_EQ(0, rmdir(log.c_str()));
+    expectDropsUntilRepaired(writer, file, [&] { ASSERT_EQ(0, mkdir(log.c_str(), 0755)); });
+
+    wq5test::writeFile(dir / "blocker", "");  // a directory below a regular file: no open, for root neither
+    DataWriter blocked(dir / "blocker/log", "wq5", 7, 0);
+    expectDropsUntilRepaired(blocked, dir / "blocker/log/20240305.wq5", [&] {
+        ASSERT_EQ(0, unlink((dir / "blocker").c_str()));
+        ASSERT_EQ(0, mkdir((dir / "blocker").c_str(), 0755));
+        ASSERT_EQ(0, mkdir((dir / "blocker/log").c_str(), 0755));
+    });
+    DataWriter absent(dir / "absent", "wq5", 7, 0);
+    EXPECT_EQ(-1, absent.checkAndOpen());
+    EXPECT_EQ(-1, absent.checkAndOpen()) << "every record tries again";
+}
+
+TEST(DataWriter, FailedOpenRetriesAlsoWhenTheClockIsSetBack)
+{
+    TempDir dir;
+    const std::string log = dir / "log";
+    ASSERT_EQ(0, mkdir(log.c_str(), 0755));
+    DataWriter writer(log, "wq5", 7, 0);
+    g_now = MAR05 + DAY + 10;
+    ASSERT_TRUE(writeRecord(writer, "a\n"));
+    fs::remove_all(log);
+    g_now = MAR05 + 2 * DAY + 10;  // the new day's open fails
+    EXPECT_FALSE(writeRecord(writer, "lost\n"));
+    ASSERT_EQ(0, mkdir(log.c_str(), 0755));
+    g_now = MAR05 + 10;  // before the day of the last open file
+    ASSERT_TRUE(writeRecord(writer, "b\n"));
+    EXPECT_EQ("b\n", readFile(log + "/20240305.wq5"));
 }
 
 }  // namespace

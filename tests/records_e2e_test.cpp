@@ -1,6 +1,6 @@
 // The real collector replaying table scripts through the simulated
-// collection library: the log holds exactly the expected records, with one
-// library thread in script order, with several in some order.
+// collection library: the log holds exactly the expected records, in script
+// order with one library thread, in some order with several.
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -13,208 +13,111 @@
 #include <sys/stat.h>
 
 #include "support/handler_fixture.h"
-#include "support/process.h"
 
 namespace {
 
 using namespace wq5test;
 
-const char HEX[] = "0123456789abcdef";
-
-// Replaces the GUID column (the fifth) of every record by "*" and its last
-// 15 characters (the counter and the collector name): the process id, time
-// and random parts differ from run to run. Reports a GUID of another shape.
-std::string maskGuids(const std::string& log, std::vector<std::string>* guids = nullptr)
+// `record` with its GUID replaced by "*" and the GUID's last `keep`
+// characters (the last 15 are its counter and the collector name); the
+// process id, time and random parts differ from run to run.
+std::string maskGuid(const std::string& record, size_t keep, std::string* guid)
 {
-    std::string out;
-    for (const std::string& line : lines(log)) {
-        std::string::size_type start = 0;
-        for (int column = 0; column < 4 && start != std::string::npos; ++column)
-            start = line.find('^', start + 1);
-        const std::string::size_type end = start == std::string::npos ? start : line.find('^', start + 1);
-        if (end == std::string::npos) {
-            ADD_FAILURE() << "record without GUID column: " << line;
-            out += line;
-            continue;
-        }
-        const std::string guid = line.substr(start + 1, end - start - 1);
-        const std::string suffix = "wq5coll";
-        const bool shaped = guid.size() > 8 + suffix.size() &&
-                            guid.compare(guid.size() - suffix.size(), suffix.size(), suffix) == 0 &&
-                            guid.find_first_not_of(HEX) == guid.size() - suffix.size();
-        EXPECT_TRUE(shaped) << "GUID <" << guid << "> in " << line;
-        if (guids != nullptr)
-            guids->push_back(guid);
-        out += line.substr(0, start + 1) + "*" + guid.substr(guid.size() < 15 ? 0 : guid.size() - 15) +
-               line.substr(end);
-    }
-    return out;
+    const size_t start = record.find("^wq5coll^") + 9, end = std::min(record.find('^', start), record.size());
+    *guid = record.substr(start, end - start);
+    const size_t hex = guid->find_first_not_of("0123456789abcdef");
+    EXPECT_TRUE(hex >= 18 && hex != std::string::npos && guid->substr(hex) == "wq5coll") << *guid << " in " << record;
+    return record.substr(0, start) + "*" + guid->substr(guid->size() - std::min(keep, guid->size())) +
+           record.substr(end);
 }
 
 class RecordsEndToEnd : public ::testing::Test {
 protected:
-    void SetUp() override
-    {
-        m_dir = makeTempDir();
-        ASSERT_FALSE(m_dir.empty());
-        ASSERT_EQ(0, mkdir((m_dir + "/log").c_str(), 0755));
-    }
+    void SetUp() override { ASSERT_EQ(0, mkdir((m_dir + "/log").c_str(), 0755)); }
     void TearDown() override { removeTree(m_dir); }
 
-    // Runs the collector over `script` with every switch on and returns
-    // what it logged; stops it with SIGTERM once the library has delivered
-    // and got back every table.
-    std::string run(const std::string& script, int threads)
+    // What the collector logs from `script`, every switch on, stopped once every table is back.
+    std::vector<std::string> run(const std::string& script, int threads)
     {
         const std::string status = m_dir + "/status.json";
         std::map<std::string, std::string> env = {
-            {"MOQ_TRACE", "error"},
-            {"MOQ_TRACE_FILE", m_dir + "/trace.log"},
-            {"WQ5_WORK_PATH", "\x01unset"},
-            {"WQ5_COLLECTOR_ID", "wq5coll"},
-            {"WQ5_LOG_DIR", m_dir + "/log"},
-            {"WQ5_LOG_SAMPLE_PERCENTAGE", "\x01unset"},
-            {"WQ5_LOG_MAX_SIZE_MB", "\x01unset"},
-            {"WQ5_FIELD_DELIMITER", "\x01unset"},
-            {"WQ5_SUB_CHAR", "\x01unset"},
-            {"ZUB1_REPLAY", script},
-            {"ZUB1_STATUS_FILE", status},
-            {"ZUB1_THREADS", std::to_string(threads)},
-            {"ZUB1_START_DELAY_MS", "\x01unset"},
-            {"ZUB1_REGISTER_FAILURES", "\x01unset"},
-        };
-        for (const char* name : {"WQ5_LOG_HTTP", "WQ5_LOG_HTTPOBJ", "WQ5_LOG_HTTPS", "WQ5_LOG_MS_VIDEO",
-                                 "WQ5_LOG_MS_AUDIO", "WQ5_LOG_REAL_VIDEO", "WQ5_LOG_REAL_AUDIO", "WQ5_LOG_QUICKTIME"})
-            env[name] = "Y";
-
+            {"MOQ_TRACE", "error"}, {"MOQ_TRACE_FILE", m_dir + "/trace.log"}, {"WQ5_COLLECTOR_ID", "wq5coll"},
+            {"WQ5_LOG_DIR", m_dir + "/log"}, {"ZUB1_REPLAY", script}, {"ZUB1_STATUS_FILE", status},
+            {"ZUB1_THREADS", std::to_string(threads)}};
+        for (const char* name : {"WQ5_WORK_PATH", "WQ5_LOG_SAMPLE_PERCENTAGE", "WQ5_LOG_MAX_SIZE_MB", "WQ5_SUB_CHAR",
+                                 "WQ5_FIELD_DELIMITER", "ZUB1_START_DELAY_MS", "ZUB1_REGISTER_FAILURES"})
+            env[name] = "\x01unset";
+        for (const char* k :
+             {"HTTP", "HTTPOBJ", "HTTPS", "MS_VIDEO", "MS_AUDIO", "REAL_VIDEO", "REAL_AUDIO", "QUICKTIME"})
+            env[std::string("WQ5_LOG_") + k] = "Y";
         Collector collector(collectorBinary(), env);
         EXPECT_TRUE(collector.started());
         EXPECT_TRUE(waitFor(m_dir, [&] { return access(status.c_str(), F_OK) == 0; }))
-            << "the library never became idle\n"
-            << readFile(m_dir + "/trace.log");
+            << "the library never became idle\n" << readFile(m_dir + "/trace.log");
         collector.signal(SIGTERM);
         const int exit = collector.wait();
-        EXPECT_NE(-1, exit) << "collector did not stop";
-        EXPECT_TRUE(WIFEXITED(exit) && WEXITSTATUS(exit) == 0) << "wait status " << exit;
-
+        EXPECT_TRUE(exit != -1 && WIFEXITED(exit) && WEXITSTATUS(exit) == 0) << "wait status " << exit;
         const std::string counts = readFile(status);
-        EXPECT_NE(std::string::npos, counts.find("\"invalid\":0")) << counts;
-        EXPECT_NE(std::string::npos, counts.find("\"unmatched\":0")) << counts;
-
-        return readLogDir();
+        EXPECT_TRUE(counts.find("\"invalid\":0") != std::string::npos &&
+                    counts.find("\"unmatched\":0") != std::string::npos) << counts;
+        return lines(readLogDir(m_dir + "/log"));
     }
 
-    std::string readLogDir() const
-    {
-        std::vector<std::string> names;
-        if (DIR* dir = opendir((m_dir + "/log").c_str())) {
-            while (struct dirent* e = readdir(dir))
-                if (e->d_name[0] != '.')
-                    names.push_back(e->d_name);
-            closedir(dir);
-        }
-        std::sort(names.begin(), names.end());
-        std::string all;
-        for (const std::string& name : names)
-            all += readFile(m_dir + "/log/" + name);
-        return all;
-    }
-
-    std::string m_dir;
+    const std::string m_dir = makeTempDir();
 };
 
 TEST_F(RecordsEndToEnd, OneLibraryThreadWritesTheExpectedRecordsInOrder)
 {
     const std::string data = std::string(WQ5_SOURCE_DIR) + "/tests/data/";
-    const std::string log = run(data + "records_single.jsonl", 1);
-    EXPECT_EQ(readFile(data + "records_single.expected"), maskGuids(log));
-}
-
-// The records of table `k` of the generated script: a page and two
-// objects on site k, and a video and an audio entry.
-std::string httpLine(int k)
-{
-    const std::string site = "http://site" + std::to_string(k);
-    return "{\"filter\":[0,80],\"entries\":[{\"rdType\":\"HTTP\",\"httpEntryType\":1,\"url\":\"" + site +
-           "/index.html\",\"title\":\"Home " + std::to_string(k) +
-           "\"},{\"rdType\":\"HTTP\",\"httpEntryType\":2,\"url\":\"" + site +
-           "/img/1.png\"},{\"rdType\":\"HTTP\",\"httpEntryType\":2,\"url\":\"" + site + "/img/2.png\"}]}\n";
-}
-
-std::string mediaLine(int k)
-{
-    return "{\"filter\":[1,0],\"entries\":[{\"rdType\":\"MSVD\",\"mediaInt0\":" + std::to_string(k) +
-           "}]}\n{\"filter\":[6,0],\"entries\":[{\"rdType\":\"RLAU\",\"mediaInt0\":" + std::to_string(k) + "}]}\n";
-}
-
-const std::string ZERO_COMMON = "0^^^0^^^0^^0^0^0^0^0^0^0^0^0^";
-const std::string ZERO_INTS = "0^0^0^0^0^0^0^0^0^0^0^0^";
-
-std::vector<std::string> expectedRecords(int k)
-{
-    const std::string n = std::to_string(k);
-    const std::string site = "site" + n;
-    const std::string head = "v121^92^0^wq5coll^*^" + ZERO_COMMON;
-    return {
-        "<hpage>" + head + "http://" + site + "/index.html^N/A^N/A^N/A^N/A^" + ZERO_INTS + site +
-            "^/index.html^index.html^N/A^N/A^Home " + n + "^0</hpage>\n",
-        "<hobj>" + head + "http://" + site + "/img/1.png^N/A^N/A^N/A^N/A^" + ZERO_INTS + site +
-            "^/img/1.png^1.png^N/A^N/A^N/A^0</hobj>\n",
-        "<hobj>" + head + "http://" + site + "/img/2.png^N/A^N/A^N/A^N/A^" + ZERO_INTS + site +
-            "^/img/2.png^2.png^N/A^N/A^N/A^0</hobj>\n",
-        "<video>" + head + "5^N/A^N/A^N/A^N/A^N/A^" + n + "^0^0</video>\n",
-        "<audio>" + head + "10^N/A^N/A^N/A^N/A^N/A^" + n + "^0^0</audio>\n",
-    };
+    std::string masked, guid;
+    for (const std::string& record : run(data + "records_single.jsonl", 1))
+        masked += maskGuid(record, 15, &guid);
+    EXPECT_EQ(readFile(data + "records_single.expected"), masked);
 }
 
 TEST_F(RecordsEndToEnd, SeveralLibraryThreadsWriteTheSameRecordsInSomeOrder)
 {
+    // Per k: a page of site k with two objects, then a video and an audio table.
     const int TABLES = 60;
+    const std::string ints = "0^0^0^0^0^0^0^0^0^0^0^0^";
     std::string script;
     std::vector<std::string> expected;
     for (int k = 0; k < TABLES; ++k) {
-        script += httpLine(k) + mediaLine(k);
-        for (const std::string& record : expectedRecords(k))
-            expected.push_back(record);
+        const std::string n = std::to_string(k), site = "http://site" + n;
+        const std::string head = "v121^92^0^wq5coll^*^0^^^0^^^0^^0^0^0^0^0^0^0^0^0^";
+        script += "{\"filter\":[0,80],\"entries\":[{\"rdType\":\"HTTP\",\"httpEntryType\":1,\"url\":\"" + site +
+                  "/index.html\",\"title\":\"Home " + n + "\"}";
+        expected.push_back("<hpage>" + head + site + "/index.html^N/A^N/A^N/A^N/A^" + ints + "site" + n +
+                           "^/index.html^index.html^N/A^N/A^Home " + n + "^0</hpage>\n");
+        for (const std::string object : {"1", "2"}) {
+            script += ",{\"rdType\":\"HTTP\",\"httpEntryType\":2,\"url\":\"" + site + "/img/" + object + ".png\"}";
+            expected.push_back("<hobj>" + head + site + "/img/" + object + ".png^N/A^N/A^N/A^N/A^" + ints + "site" +
+                               n + "^/img/" + object + ".png^" + object + ".png^N/A^N/A^N/A^0</hobj>\n");
+        }
+        script += "]}\n{\"filter\":[1,0],\"entries\":[{\"rdType\":\"MSVD\",\"mediaInt0\":" + n +
+                  "}]}\n{\"filter\":[6,0],\"entries\":[{\"rdType\":\"RLAU\",\"mediaInt0\":" + n + "}]}\n";
+        expected.push_back("<video>" + head + "5^N/A^N/A^N/A^N/A^N/A^" + n + "^0^0</video>\n");
+        expected.push_back("<audio>" + head + "10^N/A^N/A^N/A^N/A^N/A^" + n + "^0^0</audio>\n");
     }
     writeFile(m_dir + "/script.jsonl", script);
 
-    std::vector<std::string> guids;
-    const std::string log = run(m_dir + "/script.jsonl", 4);
-    const std::vector<std::string> records = lines(log);
-    maskGuids(log, &guids);
-    ASSERT_EQ(records.size(), guids.size());
-
-    // Same records, GUIDs aside: every GUID column masked to "*".
     std::vector<std::string> actual;
-    for (size_t i = 0; i < records.size(); ++i) {
-        std::string masked = records[i];
-        masked.replace(masked.find(guids[i]), guids[i].size(), "*");
-        actual.push_back(masked);
+    std::map<std::string, std::set<std::string>> siteGuids;  // the GUIDs of each site's page and objects
+    std::set<std::string> distinct;
+    for (const std::string& record : run(m_dir + "/script.jsonl", 4)) {
+        std::string guid;
+        actual.push_back(maskGuid(record, 0, &guid));
+        distinct.insert(guid);
+        const size_t site = record.find("http://site");
+        if (site != std::string::npos)
+            siteGuids[record.substr(site, record.find('/', site + 7) - site)].insert(guid);
     }
     std::sort(actual.begin(), actual.end());
     std::sort(expected.begin(), expected.end());
     EXPECT_EQ(expected, actual);
-
-    // Every object carries its page's GUID; pages and media records each
-    // have their own.
-    std::map<std::string, std::string> pageGuid;
-    std::set<std::string> own;
-    for (size_t i = 0; i < records.size(); ++i) {
-        const std::string& r = records[i];
-        if (r.compare(0, 7, "<hpage>") == 0)
-            pageGuid[r.substr(r.find("http://"), r.find("/index.html") - r.find("http://"))] = guids[i];
-        if (r.compare(0, 6, "<hobj>") != 0) {
-            EXPECT_TRUE(own.insert(guids[i]).second) << "GUID shared: " << r;
-        }
-    }
-    for (size_t i = 0; i < records.size(); ++i) {
-        const std::string& r = records[i];
-        if (r.compare(0, 6, "<hobj>") != 0)
-            continue;
-        const std::string site = r.substr(r.find("http://"), r.find("/img/") - r.find("http://"));
-        EXPECT_EQ(pageGuid[site], guids[i]) << r;
-    }
+    for (const auto& site : siteGuids)
+        EXPECT_EQ(1u, site.second.size()) << "the objects of " << site.first << " carry another GUID than their page";
+    EXPECT_EQ(size_t(3 * TABLES), distinct.size()) << "every page and media record has a GUID of its own";
 }
 
 }  // namespace

@@ -1,10 +1,12 @@
-// Whole records, byte for byte: HTTP pages and objects, video and audio,
-// the record pieces, delimiter substitution, GUIDs and the table walk.
+// Whole records byte for byte (HTTP pages and objects, video and audio), the
+// table walk, texts at their bounds and GUIDs.
 #include <gtest/gtest.h>
 
-#include <climits>
+#include <cstdio>
 #include <cstring>
+#include <sstream>
 #include <string>
+#include <vector>
 
 #include "support/handler_fixture.h"
 #include "support/table_builder.h"
@@ -12,52 +14,38 @@
 
 namespace {
 
-using wq5test::GUID0;
-using wq5test::GUID1;
-using wq5test::GUID2;
-using wq5test::GUID3;
-using wq5test::HandlerFixture;
-using wq5test::Settings;
-using wq5test::setField;
-using wq5test::setType;
-using wq5test::TableBuilder;
+using namespace wq5test;
 typedef DataHandlerTestAccess Access;
 
 const Settings HTTP_ON = {{"WQ5_LOG_HTTP", "Y"}, {"WQ5_LOG_HTTPOBJ", "Y"}};
 
-// ------------------------------------------------------------ test entries
-
-// The common part every test entry carries, and its 17 columns.
-void fillCommon(ZUB_RESPONSE_TIME_DATA& e)
-{
-    setField(e.stampText, "ABCD2024-03-05T12:34:56");
-    e.intValue = -7;
-    e.ulongValue = 4000000000u;
-    setField(e.textA, "client-a");
-    e.ushortA = 65535;
-    e.ushortB = 8080;
-    setField(e.textB, "srv-b");
-    setField(e.textC, "proxy-c");
-    e.intMetric1 = 1;
-    e.intMetric2 = 2;
-    e.intMetric3 = 3;
-    e.intMetric4 = 4;
-    e.intMetric5 = -5;
-    e.longMetric1 = 100;
-    e.longMetric2 = -200;
-    e.longMetric3 = 2147483647;
-}
-const std::string COMMON =
-    "4000000000^2024-03-05^12:34:56^-7^client-a^srv-b^65535^proxy-c^8080^1^2^3^4^-5^100^-200^2147483647^";
-
-// A page entry with every HTTP field set.
-void makePage(TableBuilder& b, int i)
+// Entry `i` with the common part of COMMON, its type code and HTTP entry type.
+ZUB_RESPONSE_TIME_DATA& makeEntry(TableBuilder& b, int i, const char* code, int httpType)
 {
     ZUB_RESPONSE_TIME_DATA& e = b.entry(i);
-    fillCommon(e);
-    setType(e, "HTTP");
+    setField(e.stampText, "ABCD2024-03-05T12:34:56");
+    setField(e.textA, "client-a");
+    setField(e.textB, "srv-b");
+    setField(e.textC, "proxy-c");
+    e.ulongValue = 4000000000u;
+    e.intValue = -7;
+    e.ushortA = 65535;
+    e.ushortB = 8080;
+    const int32_t metrics[] = {1, 2, 3, 4, -5, 100, -200, 2147483647};  // intMetric1 to longMetric3, in a row
+    memcpy(&e.intMetric1, metrics, sizeof(metrics));
+    setType(e, code);
+    if (httpType != 0)
+        e.detail.view.http.httpEntryType = httpType;
+    return e;
+}
+const std::string COMMON_TAIL = "^-7^client-a^srv-b^65535^proxy-c^8080^1^2^3^4^-5^100^-200^2147483647^";
+const std::string COMMON = "4000000000^2024-03-05^12:34:56" + COMMON_TAIL;
+
+// A page with every HTTP field set; httpInt<k> holds 10 + k, httpInt0 99.
+void makePage(TableBuilder& b, int i)
+{
+    ZUB_RESPONSE_TIME_DATA& e = makeEntry(b, i, "HTTP", 1);
     ZUB_HTTP_DETAIL& h = e.detail.view.http;
-    h.httpEntryType = 1;
     b.setText(i, e.detail.url, "http://www.example.com:8080/shop/cart.html?item=7#top");
     b.setText(i, e.detail.detailText1, "GET");
     b.setText(i, e.detail.detailText2, "200");
@@ -65,819 +53,334 @@ void makePage(TableBuilder& b, int i)
     b.setText(i, h.title, "Cart");
     setField(h.httpText, "keep-alive");
     h.httpInt0 = 99;
-    h.httpInt1 = 11;
-    h.httpInt2 = 12;
-    h.httpInt3 = 13;
-    h.httpInt4 = 14;
-    h.httpInt5 = 15;
-    h.httpInt6 = 16;
-    h.httpInt7 = 17;
-    h.httpInt8 = 18;
-    h.httpInt9 = 19;
-    h.httpInt10 = 20;
-    h.httpInt11 = 21;
-    h.httpInt12 = 22;
+    int32_t* ints[] = {&h.httpInt1, &h.httpInt2, &h.httpInt3, &h.httpInt4,  &h.httpInt5,  &h.httpInt6,
+                       &h.httpInt7, &h.httpInt8, &h.httpInt9, &h.httpInt10, &h.httpInt11, &h.httpInt12};
+    for (int k = 1; k <= 12; ++k)
+        *ints[k - 1] = 10 + k;
 }
-// The HTTP columns of makePage up to the title, and the last two.
-const std::string PAGE_UP_TO_TITLE =
-    "http://www.example.com:8080/shop/cart.html^GET^200^text/html^keep-alive^11^12^13^14^18^19^20^21^22^17^16^15^"
-    "www.example.com^/shop/cart.html^cart.html^item=7^top^";
-const std::string PAGE_TAIL = "Cart^99";
+const std::string PAGE_TO_TITLE = "http://www.example.com:8080/shop/cart.html^GET^200^text/html^keep-alive^11^12^13^"
+                                  "14^18^19^20^21^22^17^16^15^www.example.com^/shop/cart.html^cart.html^item=7^top^";
 
-// An object entry: a URL, `n` as httpInt0, everything else empty.
-void makeObject(TableBuilder& b, int i, const std::string& url, int n)
+// An object http://h/<n> with httpInt0 n, its other fields empty.
+void makeObject(TableBuilder& b, int i, int n)
 {
-    ZUB_RESPONSE_TIME_DATA& e = b.entry(i);
-    fillCommon(e);
-    setType(e, "HTTP");
-    e.detail.view.http.httpEntryType = 2;
-    e.detail.view.http.httpInt0 = n;
-    b.setText(i, e.detail.url, url);
+    makeEntry(b, i, "HTTP", 2).detail.view.http.httpInt0 = n;
+    b.setText(i, b.entry(i).detail.url, "http://h/" + std::to_string(n));
 }
 
-void makeMedia(TableBuilder& b, int i, const char* code, int a, int c, int d)
+void makeMedia(TableBuilder& b, int i, const char* code, int int0, int int1 = 0, int int2 = 0)
 {
-    ZUB_RESPONSE_TIME_DATA& e = b.entry(i);
-    fillCommon(e);
-    setType(e, code);
-    e.detail.view.media.mediaInt0 = a;
-    e.detail.view.media.mediaInt1 = c;
-    e.detail.view.media.mediaInt2 = d;
+    ZUB_MEDIA_DETAIL& m = makeEntry(b, i, code, 0).detail.view.media;
+    m.mediaInt0 = int0;
+    m.mediaInt1 = int1;
+    m.mediaInt2 = int2;
 }
 
-std::string header(const std::string& tag, const std::string& guid)
+// A record with the default delimiter.
+std::string line(const std::string& tag, const std::string& guid, const std::string& columns,
+                 const std::string& common = COMMON)
 {
-    return "<" + tag + ">v121^92^0^wq5coll^" + guid + "^";
+    return "<" + tag + ">v121^92^0^wq5coll^" + guid + "^" + common + columns + "</" + tag + ">\n";
 }
-
-std::string pageLine(const std::string& guid)
+std::string pageLine(const char* guid) { return line("hpage", guid, PAGE_TO_TITLE + "Cart^99"); }
+std::string videoLine(const char* guid, const std::string& ints, const std::string& common = COMMON)
 {
-    return header("hpage", guid) + COMMON + PAGE_UP_TO_TITLE + PAGE_TAIL + "</hpage>\n";
+    return line("video", guid, "5^N/A^N/A^N/A^N/A^N/A^" + ints, common);
 }
-
-// ------------------------------------------------------------ HTTP records
-
-TEST(HttpRecords, PageAndThreeObjectsShareThePageGuid)
+std::string objectLine(const std::string& n, const char* guid)
 {
-    HandlerFixture fixture(HTTP_ON);
-    TableBuilder b(4);
-    makePage(b, 0);
-    makeObject(b, 1, "http://img.example.com/pics/a.png", 1);
-    makeObject(b, 2, "http://img.example.com/pics/b.png?s=2", 2);
-    makeObject(b, 3, "http://img.example.com/", 3);
-    fixture.handler().processHttp(b.table());
-
-    const std::string expected =
-        "<hpage>v121^92^0^wq5coll^1a2b4d000000123400000000wq5coll^"
-        "4000000000^2024-03-05^12:34:56^-7^client-a^srv-b^65535^proxy-c^8080^1^2^3^4^-5^100^-200^2147483647^"
-        "http://www.example.com:8080/shop/cart.html^GET^200^text/html^keep-alive^11^12^13^14^18^19^20^21^22^17^16^15^"
-        "www.example.com^/shop/cart.html^cart.html^item=7^top^Cart^99</hpage>\n"
-        "<hobj>v121^92^0^wq5coll^1a2b4d000000123400000000wq5coll^"
-        "4000000000^2024-03-05^12:34:56^-7^client-a^srv-b^65535^proxy-c^8080^1^2^3^4^-5^100^-200^2147483647^"
-        "http://img.example.com/pics/a.png^N/A^N/A^N/A^N/A^0^0^0^0^0^0^0^0^0^0^0^0^"
-        "img.example.com^/pics/a.png^a.png^N/A^N/A^N/A^1</hobj>\n"
-        "<hobj>v121^92^0^wq5coll^1a2b4d000000123400000000wq5coll^"
-        "4000000000^2024-03-05^12:34:56^-7^client-a^srv-b^65535^proxy-c^8080^1^2^3^4^-5^100^-200^2147483647^"
-        "http://img.example.com/pics/b.png^N/A^N/A^N/A^N/A^0^0^0^0^0^0^0^0^0^0^0^0^"
-        "img.example.com^/pics/b.png^b.png^s=2^N/A^N/A^2</hobj>\n"
-        "<hobj>v121^92^0^wq5coll^1a2b4d000000123400000000wq5coll^"
-        "4000000000^2024-03-05^12:34:56^-7^client-a^srv-b^65535^proxy-c^8080^1^2^3^4^-5^100^-200^2147483647^"
-        "http://img.example.com/^N/A^N/A^N/A^N/A^0^0^0^0^0^0^0^0^0^0^0^0^"
-        "img.example.com^/^N/A^N/A^N/A^N/A^3</hobj>\n";
-    EXPECT_EQ(expected, fixture.log());
-    EXPECT_EQ(GUID0, Access::lastGuid(fixture.handler()));
+    return line("hobj", guid, "http://h/" + n + "^N/A^N/A^N/A^N/A^0^0^0^0^0^0^0^0^0^0^0^0^h^/" + n + "^" + n +
+                                  "^N/A^N/A^N/A^" + n);
 }
 
-TEST(HttpRecords, ObjectsWithThePageSwitchOffCarryTheUnwrittenPagesGuid)
+TEST(HttpRecords, PagesAndObjectsBySwitchAndSampling)
 {
-    HandlerFixture fixture(Settings{{"WQ5_LOG_HTTP", "N"}, {"WQ5_LOG_HTTPOBJ", "Y"}});
-    TableBuilder first(4);
-    makePage(first, 0);
-    makeObject(first, 1, "http://h/1", 1);
-    makeObject(first, 2, "http://h/2", 2);
-    makeObject(first, 3, "http://h/3", 3);
-    fixture.handler().processHttp(first.table());
-    // A later page moves the GUID on although its record is not written.
-    TableBuilder second(2);
-    makePage(second, 0);
-    makeObject(second, 1, "http://h/4", 4);
-    fixture.handler().processHttp(second.table());
-
-    const std::string rest = "^N/A^N/A^N/A^N/A^0^0^0^0^0^0^0^0^0^0^0^0^h^/";
-    const std::string expected =
-        header("hobj", GUID0) + COMMON + "http://h/1" + rest + "1^1^N/A^N/A^N/A^1</hobj>\n" +
-        header("hobj", GUID0) + COMMON + "http://h/2" + rest + "2^2^N/A^N/A^N/A^2</hobj>\n" +
-        header("hobj", GUID0) + COMMON + "http://h/3" + rest + "3^3^N/A^N/A^N/A^3</hobj>\n" +
-        header("hobj", GUID1) + COMMON + "http://h/4" + rest + "4^4^N/A^N/A^N/A^4</hobj>\n";
-    EXPECT_EQ(expected, fixture.log());
+    // tables: P page, O object (numbered from 1 in order), | the next table;
+    // records: P@g page record, On@g record of object n, with GUID g.
+    const struct { const char* what; Settings settings; const char* tables, *records; int lastGuid; } rows[] = {
+        {"both on: a page and its three objects share its GUID", HTTP_ON, "POOO", "P@0 O1@0 O2@0 O3@0", 0},
+        {"page switch off: objects carry the unwritten page's GUID, the next page moves it on",
+         {{"WQ5_LOG_HTTP", "N"}, {"WQ5_LOG_HTTPOBJ", "Y"}}, "POOO|PO", "O1@0 O2@0 O3@0 O4@1", 1},
+        {"only secure HTTP on: nothing written, every page makes a GUID", {{"WQ5_LOG_HTTPS", "Y"}}, "POP", "", 1},
+        {"objects before any page share the GUID the first one made", HTTP_ON, "OO|O", "O1@0 O2@0 O3@0", 0},
+        {"50 %: objects follow their page; one heading a table follows the latest page",
+         {{"WQ5_LOG_HTTP", "Y"}, {"WQ5_LOG_HTTPOBJ", "Y"}, {"WQ5_LOG_SAMPLE_PERCENTAGE", "50"}}, "POPO|OPO",
+         "P@0 O1@0 P@2 O4@2", 2},
+    };
+    for (const auto& r : rows) {
+        HandlerFixture fixture(r.settings);
+        std::istringstream tables(r.tables);
+        int object = 0;
+        for (std::string table; std::getline(tables, table, '|');) {
+            TableBuilder b(static_cast<int>(table.size()));
+            for (int i = 0; i < b.count(); ++i)
+                table[i] == 'P' ? makePage(b, i) : makeObject(b, i, ++object);
+            fixture.handler().processHttp(b.table());
+        }
+        std::string expected;
+        std::istringstream records(r.records);
+        for (std::string t; records >> t;) {
+            const char* guid = GUID[t.back() - '0'];
+            expected += t[0] == 'P' ? pageLine(guid) : objectLine(t.substr(1, t.find('@') - 1), guid);
+        }
+        EXPECT_EQ(expected, fixture.log()) << r.what;
+        EXPECT_EQ(GUID[r.lastGuid], Access::lastGuid(fixture.handler())) << r.what;
+    }
 }
 
-TEST(HttpRecords, PagesWithThePageSwitchOffStillMakeGuids)
-{
-    // Only secure HTTP on: nothing is written, every page makes a GUID.
-    HandlerFixture fixture(Settings{{"WQ5_LOG_HTTPS", "Y"}});
-    TableBuilder b(3);
-    makePage(b, 0);
-    makeObject(b, 1, "http://h/1", 1);
-    makePage(b, 2);
-    fixture.handler().processHttp(b.table());
-    EXPECT_EQ("", fixture.log());
-    EXPECT_EQ(GUID1, Access::lastGuid(fixture.handler()));
-}
-
-TEST(HttpRecords, ObjectsBeforeAnyPageShareTheGuidTheFirstOneMade)
+TEST(HttpRecords, OtherEntriesArePassedOverAndEveryHttpEntryIsTraced)
 {
     HandlerFixture fixture(HTTP_ON);
-    TableBuilder first(2);
-    makeObject(first, 0, "http://h/1", 1);
-    makeObject(first, 1, "http://h/2", 2);
-    fixture.handler().processHttp(first.table());
-    // An object in a later table follows the last GUID of the handler.
-    TableBuilder second(1);
-    makeObject(second, 0, "http://h/3", 3);
-    fixture.handler().processHttp(second.table());
-
-    const std::string rest = "^N/A^N/A^N/A^N/A^0^0^0^0^0^0^0^0^0^0^0^0^h^/";
-    const std::string expected =
-        header("hobj", GUID0) + COMMON + "http://h/1" + rest + "1^1^N/A^N/A^N/A^1</hobj>\n" +
-        header("hobj", GUID0) + COMMON + "http://h/2" + rest + "2^2^N/A^N/A^N/A^2</hobj>\n" +
-        header("hobj", GUID0) + COMMON + "http://h/3" + rest + "3^3^N/A^N/A^N/A^3</hobj>\n";
-    EXPECT_EQ(expected, fixture.log());
-}
-
-TEST(HttpRecords, ObjectsFollowTheSamplingDecisionOfTheirPage)
-{
-    // 50 %: pages pass and drop in turn, and their objects with them; an
-    // object at the head of a table follows the latest page decision.
-    HandlerFixture fixture(Settings{{"WQ5_LOG_HTTP", "Y"}, {"WQ5_LOG_HTTPOBJ", "Y"}, {"WQ5_LOG_SAMPLE_PERCENTAGE", "50"}});
-    TableBuilder first(4);
-    makePage(first, 0);                     // passes, GUID0
-    makeObject(first, 1, "http://h/1", 1);  // written
-    makePage(first, 2);                     // dropped, GUID1
-    makeObject(first, 3, "http://h/2", 2);  // dropped with it
-    fixture.handler().processHttp(first.table());
-    TableBuilder second(3);
-    makeObject(second, 0, "http://h/3", 3);  // follows the dropped page
-    makePage(second, 1);                     // passes, GUID2
-    makeObject(second, 2, "http://h/4", 4);  // written
-    fixture.handler().processHttp(second.table());
-
-    const std::string rest = "^N/A^N/A^N/A^N/A^0^0^0^0^0^0^0^0^0^0^0^0^h^/";
-    const std::string expected = pageLine(GUID0) + header("hobj", GUID0) + COMMON + "http://h/1" + rest +
-                                 "1^1^N/A^N/A^N/A^1</hobj>\n" + pageLine(GUID2) + header("hobj", GUID2) + COMMON +
-                                 "http://h/4" + rest + "4^4^N/A^N/A^N/A^4</hobj>\n";
-    EXPECT_EQ(expected, fixture.log());
-}
-
-TEST(HttpRecords, OnlyHttpEntriesOfType1And2AreWritten)
-{
-    HandlerFixture fixture(HTTP_ON);
-    TableBuilder b(4);
-    makeMedia(b, 0, "MSVD", 1, 2, 3);
+    TableBuilder b(5);
+    makeMedia(b, 0, "MSVD", 1);
     makePage(b, 1);
-    setType(b.entry(1), "http");  // lower case: not an HTTP entry
+    setType(b.entry(1), "http");  // lower case: no HTTP entry
     makePage(b, 2);
     b.entry(2).detail.view.http.httpEntryType = 3;
     makePage(b, 3);
-    b.entry(3).detail.view.http.httpEntryType = 0;
-
-    TraceCapture trace(TRC_DETAIL);
-    fixture.handler().processHttp(b.table());
-    EXPECT_EQ("", fixture.log());
-    EXPECT_EQ(1, trace.count("  total entries <4>"));
-    EXPECT_EQ(0, trace.count("  processing entry <0> type <0>"));
-    EXPECT_EQ(0, trace.count("  processing entry <1> type <1>"));
-    EXPECT_EQ(1, trace.count("  processing entry <2> type <3>"));
-    EXPECT_EQ(1, trace.count("  processing entry <3> type <0>"));
-    EXPECT_EQ(-1, trace.indexOf("    writing <2> tag <hpage>"));
-    EXPECT_EQ("", Access::lastGuid(fixture.handler()));
-}
-
-TEST(HttpRecords, TraceLinesOfAWrittenPage)
-{
-    HandlerFixture fixture(HTTP_ON);
-    TableBuilder b(2);
-    makePage(b, 0);
-    makeObject(b, 1, "", 1);
+    makeObject(b, 4, 4);
+    b.entry(4).detail.url = 0;
     TraceCapture trace(TRC_DETAIL);
     fixture.handler().processHttp(b.table());
 
-    const char* const expected[] = {
-        "  total entries <2>",
-        "  processing entry <0> type <1>",
-        "    writing <0> tag <hpage>",
-        "    url <http://www.example.com:8080/shop/cart.html?item=7#top>",
-        "  processing entry <1> type <2>",
-        "    writing <1> tag <hobj>",
-        "    url <N/A>",
-    };
-    int last = -1;
-    for (const char* line : expected) {
-        const int at = trace.indexOf(line);
-        EXPECT_GT(at, last) << "line <" << line << "> missing or out of order";
-        last = at;
-    }
-    EXPECT_EQ(0, trace.count("Failed to open log file."));
+    EXPECT_EQ(pageLine(GUID[0]) +
+                  line("hobj", GUID[0], "N/A^N/A^N/A^N/A^N/A^0^0^0^0^0^0^0^0^0^0^0^0^N/A^N/A^N/A^N/A^N/A^N/A^4"),
+              fixture.log());
+    char table[32];
+    snprintf(table, sizeof(table), "%p", static_cast<void*>(b.table()));
+    const std::vector<std::string> expected = {
+        "processing table <" + std::string(table) + ">", "  total entries <5>", "  processing entry <2> type <3>",
+        "  processing entry <3> type <1>", "    writing <3> tag <hpage>",
+        "    url <http://www.example.com:8080/shop/cart.html?item=7#top>", "  processing entry <4> type <2>",
+        "    writing <4> tag <hobj>", "    url <N/A>"};
+    std::vector<std::string> traced;
+    for (const std::string& l : trace.lines())
+        if (l.find(" DataHandler::processHttp: ") != std::string::npos)
+            traced.push_back(l.substr(l.find("processHttp: ") + 13, l.size() - l.find("processHttp: ") - 14));
+    EXPECT_EQ(expected, traced);
 }
-
-struct TitleCase {
-    const char* name;
-    const char* title;  // null: no title reference
-    const char* column;
-};
 
 TEST(HttpRecords, TitleColumn)
 {
-    const TitleCase cases[] = {
-        {"plain", "Cart", "Cart"},
-        {"NO_TITLE_FOUND", "NO_TITLE_FOUND", "N/A"},
-        {"null", nullptr, "N/A"},
-        {"empty", "", "N/A"},
-        {"longer than the marker", "NO_TITLE_FOUND!", "NO_TITLE_FOUND!"},
-        {"shorter than the marker", "NO_TITLE", "NO_TITLE"},
-    };
-    for (const TitleCase& c : cases) {
-        SCOPED_TRACE(c.name);
+    const struct { const char* title, *column; } rows[] = {{"Cart", "Cart"}, {"NO_TITLE_FOUND", "N/A"},
+        {nullptr, "N/A"}, {"", "N/A"}, {"NO_TITLE_FOUND!", "NO_TITLE_FOUND!"}, {"NO_TITLE", "NO_TITLE"}};
+    for (const auto& r : rows) {
         HandlerFixture fixture(HTTP_ON);
         TableBuilder b(1);
         makePage(b, 0);
         b.entry(0).detail.view.http.title = 0;
-        if (c.title != nullptr)
-            b.setText(0, b.entry(0).detail.view.http.title, c.title);
+        if (r.title != nullptr)
+            b.setText(0, b.entry(0).detail.view.http.title, r.title);
         fixture.handler().processHttp(b.table());
-        EXPECT_EQ(header("hpage", GUID0) + COMMON + PAGE_UP_TO_TITLE + c.column + "^99</hpage>\n", fixture.log());
+        EXPECT_EQ(line("hpage", GUID[0], PAGE_TO_TITLE + r.column + "^99"), fixture.log())
+            << "title <" << (r.title != nullptr ? r.title : "null") << ">";
     }
 }
 
-TEST(HttpRecords, NullUrlGivesNAInEveryUrlColumn)
+TEST(HttpRecords, DelimiterInDetailTextsIsSubstitutedInPlaceBeforeTheTitleTest)
 {
-    HandlerFixture fixture(HTTP_ON);
-    TableBuilder b(1);
-    makePage(b, 0);
-    b.entry(0).detail.url = 0;
-    TraceCapture trace(TRC_DETAIL);
-    fixture.handler().processHttp(b.table());
-    EXPECT_EQ(header("hpage", GUID0) + COMMON +
-                  "N/A^GET^200^text/html^keep-alive^11^12^13^14^18^19^20^21^22^17^16^15^N/A^N/A^N/A^N/A^N/A^"
-                  "Cart^99</hpage>\n",
-              fixture.log());
-    EXPECT_EQ(1, trace.count("    url <N/A>"));
+    const struct { const char* delimiter, *sub, *urlAfter, *record; } rows[] = {
+        {"_", "-", "http://h/my-page.html?a-b=1#x-y",
+         "<hpage>v121_92_0_wq5coll_1a2b4d000000123400000000wq5coll_"
+         "4000000000_2024-03-05_12:34:56_-7_a_b/c_srv-b_65535_proxy-c_8080_1_2_3_4_-5_100_-200_2147483647_"
+         "http://h/my-page.html_GET-X/Y_N/A_N/A_gz-ip_11_12_13_14_18_19_20_21_22_17_16_15_"
+         "h_/my-page.html_my-page.html_a-b=1_x-y_NO-TITLE-FOUND_99</hpage>\n"},
+        // The URL loses its "//" and so its host; "N/A" keeps its "/".
+        {"/", "_", "http:__h_my_page.html?a_b=1#x_y",
+         "<hpage>v121/92/0/wq5coll/1a2b4d000000123400000000wq5coll/"
+         "4000000000/2024-03-05/12:34:56/-7/a_b/c/srv-b/65535/proxy-c/8080/1/2/3/4/-5/100/-200/2147483647/"
+         "http:__h_my_page.html/GET_X_Y/N/A/N/A/gz_ip/11/12/13/14/18/19/20/21/22/17/16/15/"
+         "N/A/__h_my_page.html/__h_my_page.html/a_b=1/x_y/N/A/99</hpage>\n"},
+    };
+    for (const auto& r : rows) {
+        SCOPED_TRACE(std::string("delimiter ") + r.delimiter);
+        HandlerFixture fixture({{"WQ5_LOG_HTTP", "Y"}, {"WQ5_FIELD_DELIMITER", r.delimiter}, {"WQ5_SUB_CHAR", r.sub}});
+        TableBuilder b(1);
+        makePage(b, 0);
+        ZUB_RESPONSE_TIME_DATA& e = b.entry(0);
+        setField(e.textA, "a_b/c");  // a common text: never substituted
+        const char* url = b.setText(0, e.detail.url, "http://h/my_page.html?a_b=1#x_y");
+        b.setText(0, e.detail.detailText1, "GET_X/Y");
+        e.detail.detailText2 = 0;
+        b.setText(0, e.detail.detailText3, "");
+        b.setText(0, e.detail.view.http.title, "NO_TITLE_FOUND");
+        setField(e.detail.view.http.httpText, "gz_ip");
+        TraceCapture trace(TRC_DETAIL);
+        fixture.handler().processHttp(b.table());
+        EXPECT_EQ(r.record, fixture.log());
+        EXPECT_STREQ(r.urlAfter, url);
+        EXPECT_EQ(1, trace.count("    url <http://h/my_page.html?a_b=1#x_y>")) << "traced before the substitution";
+    }
 }
 
-TEST(HttpRecords, UnderscoreDelimiterWithDashSubstitute)
-{
-    HandlerFixture fixture(Settings{{"WQ5_LOG_HTTP", "Y"}, {"WQ5_FIELD_DELIMITER", "_"}, {"WQ5_SUB_CHAR", "-"}});
-    TableBuilder b(1);
-    makePage(b, 0);
-    ZUB_RESPONSE_TIME_DATA& e = b.entry(0);
-    char* url = b.setText(0, e.detail.url, "http://h/my_page.html?a_b=1#x_y");
-    b.setText(0, e.detail.detailText1, "GET_X");
-    e.detail.detailText2 = 0;
-    b.setText(0, e.detail.detailText3, "");
-    char* title = b.setText(0, e.detail.view.http.title, "NO_TITLE_FOUND");
-    setField(e.detail.view.http.httpText, "gz_ip");
-
-    TraceCapture trace(TRC_DETAIL);
-    fixture.handler().processHttp(b.table());
-
-    // The title is compared after the substitution, so it is kept.
-    EXPECT_EQ("<hpage>v121_92_0_wq5coll_1a2b4d000000123400000000wq5coll_"
-              "4000000000_2024-03-05_12:34:56_-7_client-a_srv-b_65535_proxy-c_8080_1_2_3_4_-5_100_-200_2147483647_"
-              "http://h/my-page.html_GET-X_N/A_N/A_gz-ip_11_12_13_14_18_19_20_21_22_17_16_15_"
-              "h_/my-page.html_my-page.html_a-b=1_x-y_NO-TITLE-FOUND_99</hpage>\n",
-              fixture.log());
-    // The trace shows the URL as delivered; the entry keeps the change.
-    EXPECT_EQ(1, trace.count("    url <http://h/my_page.html?a_b=1#x_y>"));
-    EXPECT_STREQ("http://h/my-page.html?a-b=1#x-y", url);
-    EXPECT_STREQ("NO-TITLE-FOUND", title);
-    EXPECT_STREQ("gz-ip", e.detail.view.http.httpText);
-}
-
-TEST(HttpRecords, SlashDelimiterIsLeftInsideNA)
-{
-    HandlerFixture fixture(Settings{{"WQ5_LOG_HTTP", "Y"}, {"WQ5_FIELD_DELIMITER", "/"}});
-    TableBuilder b(1);
-    ZUB_RESPONSE_TIME_DATA& e = b.entry(0);
-    fillCommon(e);
-    setType(e, "HTTP");
-    e.detail.view.http.httpEntryType = 1;
-    e.detail.view.http.httpInt0 = 5;
-    b.setText(0, e.detail.url, "http://h/a");
-    fixture.handler().processHttp(b.table());
-
-    // The URL becomes http:__h_a, which has no "//" and so no host.
-    EXPECT_EQ("<hpage>v121/92/0/wq5coll/1a2b4d000000123400000000wq5coll/"
-              "4000000000/2024-03-05/12:34:56/-7/client-a/srv-b/65535/proxy-c/8080/1/2/3/4/-5/100/-200/2147483647/"
-              "http:__h_a/N/A/N/A/N/A/N/A/0/0/0/0/0/0/0/0/0/0/0/0/N/A/__h_a/__h_a/N/A/N/A/N/A/5</hpage>\n",
-              fixture.log());
-}
-
-TEST(HttpRecords, DelimiterInsideACommonTextStays)
-{
-    HandlerFixture fixture(Settings{{"WQ5_LOG_HTTP", "Y"}, {"WQ5_FIELD_DELIMITER", "|"}});
-    TableBuilder b(1);
-    makePage(b, 0);
-    setField(b.entry(0).textA, "a|b");
-    b.setText(0, b.entry(0).detail.detailText1, "G|T");
-    fixture.handler().processHttp(b.table());
-    EXPECT_EQ("<hpage>v121|92|0|wq5coll|1a2b4d000000123400000000wq5coll|"
-              "4000000000|2024-03-05|12:34:56|-7|a|b|srv-b|65535|proxy-c|8080|1|2|3|4|-5|100|-200|2147483647|"
-              "http://www.example.com:8080/shop/cart.html|G_T|200|text/html|keep-alive|11|12|13|14|18|19|20|21|22|"
-              "17|16|15|www.example.com|/shop/cart.html|cart.html|item=7|top|Cart|99</hpage>\n",
-              fixture.log());
-}
-
-// ------------------------------------------------------------ media records
-
-TEST(MediaRecords, NullTextsAndNumbersOneTwoThree)
+TEST(MediaRecords, VideoAndAudioEntriesOfTheirCodesEachWithANewGuid)
 {
     HandlerFixture fixture;
-    TableBuilder b(1);
-    makeMedia(b, 0, "MSVD", 1, 2, 3);
-    fixture.handler().processVideo(b.table());
-    EXPECT_EQ("<video>v121^92^0^wq5coll^1a2b4d000000123400000000wq5coll^"
-              "4000000000^2024-03-05^12:34:56^-7^client-a^srv-b^65535^proxy-c^8080^1^2^3^4^-5^100^-200^2147483647^"
-              "5^N/A^N/A^N/A^N/A^N/A^1^2^3</video>\n",
-              fixture.log());
-}
-
-TEST(MediaRecords, VideoCodesEachWithANewGuid)
-{
-    HandlerFixture fixture;
-    TableBuilder b(5);
-    makeMedia(b, 0, "QTIM", -1, 0, 2147483647);
-    makeMedia(b, 1, "HTTP", 0, 0, 0);  // not a video entry
-    makeMedia(b, 2, "REAL", 6, 6, 6);
-    makeMedia(b, 3, "MSAU", 9, 9, 9);  // audio, not video
-    makeMedia(b, 4, "MSVD", 5, 5, 5);
-    fixture.handler().processVideo(b.table());
-    EXPECT_EQ(header("video", GUID0) + COMMON + "7^N/A^N/A^N/A^N/A^N/A^-1^0^2147483647</video>\n" +
-                  header("video", GUID1) + COMMON + "6^N/A^N/A^N/A^N/A^N/A^6^6^6</video>\n" +
-                  header("video", GUID2) + COMMON + "5^N/A^N/A^N/A^N/A^N/A^5^5^5</video>\n",
-              fixture.log());
-    EXPECT_EQ(GUID2, Access::lastGuid(fixture.handler()));
-}
-
-TEST(MediaRecords, AudioTextsAreSubstitutedInPlace)
-{
-    HandlerFixture fixture;
-    TableBuilder b(3);
-    makeMedia(b, 0, "RLAU", -1, 0, 7);
-    ZUB_RESPONSE_TIME_DATA& e = b.entry(0);
-    b.setText(0, e.detail.url, "rtsp://media.example.com/clip");
-    b.setText(0, e.detail.detailText1, "");
-    char* text2 = b.setText(0, e.detail.detailText2, "a^b");
-    b.setText(0, e.detail.detailText3, "mp3");
+    TableBuilder video(5);
+    const char* codes[] = {"MSVD", "HTTP", "REAL", "MSAU", "QTIM"};
+    for (int i = 0; i < 5; ++i)
+        makeMedia(video, i, codes[i], i + 1, 2, 3);
+    video.entry(2).registeredFlag = 0;  // only the first entry's flag counts
+    TableBuilder audio(3);
+    makeMedia(audio, 0, "RLAU", -4, 5, 2147483647);
+    ZUB_RESPONSE_TIME_DATA& e = audio.entry(0);
+    audio.setText(0, e.detail.url, "rtsp://m/clip");
+    audio.setText(0, e.detail.detailText1, "");
+    const char* text2 = audio.setText(0, e.detail.detailText2, "a^^b");
+    audio.setText(0, e.detail.detailText3, "mp3");
     setField(e.detail.view.media.mediaText, "codec^x");
-    makeMedia(b, 1, "MSVD", 1, 1, 1);  // video, not audio
-    makeMedia(b, 2, "MSAU", 2, 2, 2);
-    fixture.handler().processAudio(b.table());
-    EXPECT_EQ(header("audio", GUID0) + COMMON + "10^rtsp://media.example.com/clip^N/A^a_b^mp3^codec_x^-1^0^7</audio>\n" +
-                  header("audio", GUID1) + COMMON + "9^N/A^N/A^N/A^N/A^N/A^2^2^2</audio>\n",
+    makeMedia(audio, 1, "MSVD", 1);
+    makeMedia(audio, 2, "MSAU", 2);
+    fixture.handler().processVideo(video.table());
+    fixture.handler().processAudio(audio.table());
+
+    EXPECT_EQ(videoLine(GUID[0], "1^2^3") + line("video", GUID[1], "6^N/A^N/A^N/A^N/A^N/A^3^2^3") +
+                  line("video", GUID[2], "7^N/A^N/A^N/A^N/A^N/A^5^2^3") +
+                  line("audio", GUID[3], "10^rtsp://m/clip^N/A^a__b^mp3^codec_x^-4^5^2147483647") +
+                  line("audio", GUID[4], "9^N/A^N/A^N/A^N/A^N/A^2^0^0"),
               fixture.log());
-    EXPECT_STREQ("a_b", text2);
+    EXPECT_STREQ("a__b", text2);
     EXPECT_STREQ("codec_x", e.detail.view.media.mediaText);
+    EXPECT_EQ(GUID[4], Access::lastGuid(fixture.handler()));
 }
 
 TEST(MediaRecords, FiftyPercentCountsEveryEntryOfTheTable)
 {
-    {
-        HandlerFixture fixture(Settings{{"WQ5_LOG_SAMPLE_PERCENTAGE", "50"}});
-        TableBuilder b(4);
-        for (int i = 0; i < 4; ++i)
-            makeMedia(b, i, "MSVD", i, 0, 0);
-        fixture.handler().processVideo(b.table());
-        EXPECT_EQ(header("video", GUID0) + COMMON + "5^N/A^N/A^N/A^N/A^N/A^0^0^0</video>\n" +
-                      header("video", GUID1) + COMMON + "5^N/A^N/A^N/A^N/A^N/A^2^0^0</video>\n",
-                  fixture.log());
-    }
-    {
-        // The sampler passes entries 0 and 2, which are not video entries.
-        HandlerFixture fixture(Settings{{"WQ5_LOG_SAMPLE_PERCENTAGE", "50"}, {"WQ5_LOG_HTTP", "Y"}});
-        TableBuilder b(4);
-        makeMedia(b, 0, "HTTP", 0, 0, 0);
-        makeMedia(b, 1, "MSVD", 1, 0, 0);
-        makeMedia(b, 2, "HTTP", 2, 0, 0);
-        makeMedia(b, 3, "MSVD", 3, 0, 0);
-        fixture.handler().processVideo(b.table());
-        EXPECT_EQ("", fixture.log());
-        EXPECT_EQ("", Access::lastGuid(fixture.handler()));
-        // The HTTP sampler has not moved: its first page passes.
-        TableBuilder page(1);
-        makePage(page, 0);
-        fixture.handler().processHttp(page.table());
-        EXPECT_EQ(pageLine(GUID0), fixture.log());
-    }
-}
-
-// ------------------------------------------------------------ table walk
-
-TEST(TableWalk, FirstEntryUnregisteredDisconnectsAndWritesNothing)
-{
-    HandlerFixture fixture(Settings{{"WQ5_LOG_HTTP", "Y"}, {"WQ5_LOG_SAMPLE_PERCENTAGE", "50"}});
-    TableBuilder http(3);
-    makePage(http, 0);
-    makePage(http, 1);
-    makePage(http, 2);
-    http.entry(0).registeredFlag = 0;
-    TableBuilder video(3);
-    makeMedia(video, 0, "MSVD", 0, 0, 0);
-    makeMedia(video, 1, "MSVD", 1, 0, 0);
-    makeMedia(video, 2, "MSVD", 2, 0, 0);
-    video.entry(0).registeredFlag = 0;
-    TableBuilder audio(2);
-    makeMedia(audio, 0, "MSAU", 0, 0, 0);
-    makeMedia(audio, 1, "MSAU", 1, 0, 0);
-    audio.entry(0).registeredFlag = 0;
-
-    TraceCapture trace(TRC_DETAIL);
-    fixture.handler().processHttp(http.table());
-    fixture.handler().processVideo(video.table());
-    fixture.handler().processAudio(audio.table());
-
-    EXPECT_EQ("", fixture.log());
-    EXPECT_EQ(3, trace.count("disconnecting id = <0>"));
-    EXPECT_EQ(1, trace.count("  total entries <3>"));
-    EXPECT_EQ(-1, trace.indexOf("  processing entry <1> type <1>"));
-    EXPECT_EQ("", Access::lastGuid(fixture.handler()));
-    EXPECT_EQ(0, Access::count(*Access::httpSampler(fixture.handler())));
-    EXPECT_EQ(0, Access::count(*Access::videoSampler(fixture.handler())));
-    EXPECT_EQ(0, Access::count(*Access::audioSampler(fixture.handler())));
-}
-
-TEST(TableWalk, LaterEntriesUnregisteredAreProcessed)
-{
-    HandlerFixture fixture;
-    TableBuilder b(3);
-    for (int i = 0; i < 3; ++i)
-        makeMedia(b, i, "MSVD", i, 0, 0);
-    b.entry(1).registeredFlag = 0;
-    b.entry(2).registeredFlag = 0;
-    TraceCapture trace(TRC_DETAIL);
+    HandlerFixture fixture({{"WQ5_LOG_SAMPLE_PERCENTAGE", "50"}, {"WQ5_LOG_HTTP", "Y"}});
+    TableBuilder b(4);
+    for (int i = 0; i < 4; ++i)
+        makeMedia(b, i, "MSVD", i);
     fixture.handler().processVideo(b.table());
-    EXPECT_EQ(header("video", GUID0) + COMMON + "5^N/A^N/A^N/A^N/A^N/A^0^0^0</video>\n" + header("video", GUID1) +
-                  COMMON + "5^N/A^N/A^N/A^N/A^N/A^1^0^0</video>\n" + header("video", GUID2) + COMMON +
-                  "5^N/A^N/A^N/A^N/A^N/A^2^0^0</video>\n",
-              fixture.log());
-    EXPECT_EQ(0, trace.count("disconnecting id = <0>"));
+    // The sampler passes entries 0 and 2 again, which are no video entries now.
+    setType(b.entry(0), "HTTP");
+    setType(b.entry(2), "HTTP");
+    fixture.handler().processVideo(b.table());
+    // The HTTP page sampler has not moved: its first page passes.
+    TableBuilder page(1);
+    makePage(page, 0);
+    fixture.handler().processHttp(page.table());
+    EXPECT_EQ(videoLine(GUID[0], "0^0^0") + videoLine(GUID[1], "2^0^0") + pageLine(GUID[2]), fixture.log());
 }
 
-struct CountCase {
-    const char* name;
-    int32_t entryCount;
-    bool entriesPresent;
-    uint32_t firstFlag;
-    int disconnects;
-};
-
-TEST(TableWalk, TablesWithoutEntriesWriteNothing)
+TEST(TableWalk, TablesWithNothingToWalkWriteNothingAndMoveNoSampler)
 {
-    const CountCase cases[] = {
-        {"negative count", -1, true, 1, 0},
-        {"most negative count", INT32_MIN, true, 1, 0},
-        {"zero count", 0, true, 1, 0},
-        // The flag is read before the count, as the library expects.
-        {"zero count, first entry unregistered", 0, true, 0, 1},
-        {"negative count, first entry unregistered", -3, true, 0, 1},
-        // Nothing is read through a null entry reference.
-        {"null entries", 2, false, 0, 0},
-    };
-    for (const CountCase& c : cases) {
-        SCOPED_TRACE(c.name);
-        HandlerFixture fixture(HTTP_ON);
+    const struct { const char* what; int32_t count; bool entries; uint32_t firstFlag; int disconnects; } rows[] = {
+        {"first entry unregistered, later ones valid", 2, true, 0, 3}, {"negative count", -1, true, 1, 0},
+        {"most negative count", INT32_MIN, true, 1, 0}, {"zero count", 0, true, 1, 0},
+        {"zero count, first entry unregistered: the flag is read first", 0, true, 0, 3},
+        {"no entry area", 2, false, 0, 0}};
+    const auto all = {&DataHandler::processHttp, &DataHandler::processVideo, &DataHandler::processAudio};
+    for (const auto& r : rows) {
+        HandlerFixture fixture({{"WQ5_LOG_HTTP", "Y"}, {"WQ5_LOG_SAMPLE_PERCENTAGE", "50"}});
         TableBuilder b(2);
         makePage(b, 0);
-        makeMedia(b, 1, "MSVD", 1, 2, 3);
-        b.entry(0).registeredFlag = c.firstFlag;
-        b.table()->entryCount = c.entryCount;
-        b.setEntriesRef(c.entriesPresent);
+        makeMedia(b, 1, "MSVD", 1);
+        b.entry(0).registeredFlag = r.firstFlag;
+        b.table()->entryCount = r.count;
+        b.setEntriesRef(r.entries);
         TraceCapture trace(TRC_DETAIL);
-        fixture.handler().processHttp(b.table());
-        fixture.handler().processVideo(b.table());
-        fixture.handler().processAudio(b.table());
-        EXPECT_EQ("", fixture.log());
-        EXPECT_EQ(3 * c.disconnects, trace.count("disconnecting id = <0>"));
-        EXPECT_EQ(1, trace.count("  total entries <" + std::to_string(c.entryCount) + ">"));
-        EXPECT_EQ(0, trace.count("  processing entry <0> type <1>"));
+        for (auto process : all)
+            (fixture.handler().*process)(b.table());
+        std::string decisions;  // a sampler that has counted nothing passes one record, then drops one
+        for (int kind = 0; kind < 6; ++kind)
+            decisions += Access::sampler(fixture.handler(), kind / 2).checkSampling() ? 'K' : '-';
+        EXPECT_EQ("", fixture.log() + Access::lastGuid(fixture.handler())) << r.what << ": no record, no GUID";
+        EXPECT_EQ(r.disconnects, trace.count("disconnecting id = <0>")) << r.what;
+        EXPECT_EQ("K-K-K-", decisions) << r.what;
     }
-}
-
-TEST(TableWalk, NullTableTracesOnlyItsFirstLine)
-{
+    // Null tables; a handler without settings, writer or samplers; a log that cannot be opened.
     HandlerFixture fixture(HTTP_ON);
-    TraceCapture trace(TRC_DETAIL | TRC_ERROR | TRC_INFO);
-    fixture.handler().processHttp(nullptr);
-    fixture.handler().processVideo(nullptr);
-    fixture.handler().processAudio(nullptr);
-    const std::vector<std::string> all = trace.lines();
-    ASSERT_EQ(3u, all.size());
-    for (const std::string& line : all)
-        EXPECT_NE(std::string::npos, line.find("processing table <")) << line;
-    EXPECT_EQ("", fixture.log());
-}
-
-TEST(TableWalk, HandlerWithoutManagerIgnoresTables)
-{
-    DataHandler handler(nullptr);
-    TableBuilder b(1);
-    makePage(b, 0);
-    b.entry(0).registeredFlag = 0;
-    handler.processHttp(b.table());
-    handler.processVideo(b.table());
-    handler.processAudio(b.table());
-    EXPECT_EQ("", Access::lastGuid(handler));
-}
-
-TEST(TableWalk, UnopenableLogIsTracedPerRecordAndProcessingGoesOn)
-{
-    HandlerFixture fixture(Settings{{"WQ5_LOG_HTTP", "Y"}}, false);  // no log directory
-    TableBuilder b(2);
+    ASSERT_EQ(0, rmdir(fixture.logDir().c_str()));
+    DataHandler bare(nullptr);
+    TableBuilder b(3);
     makePage(b, 0);
     makePage(b, 1);
+    makeMedia(b, 2, "MSVD", 1);
     TraceCapture trace(TRC_ERROR);
-    fixture.handler().processHttp(b.table());
-    TableBuilder v(1);
-    makeMedia(v, 0, "MSVD", 1, 2, 3);
-    fixture.handler().processVideo(v.table());
-    EXPECT_EQ(3, trace.count("Failed to open log file."));
-    EXPECT_EQ(GUID2, Access::lastGuid(fixture.handler()));
+    for (auto process : all) {
+        (fixture.handler().*process)(nullptr);
+        (bare.*process)(b.table());
+        (fixture.handler().*process)(b.table());
+    }
+    EXPECT_EQ("", Access::lastGuid(bare));
+    EXPECT_EQ(3, trace.count("Failed to open log file.")) << "each record tells, the walk goes on";
+    EXPECT_EQ(GUID[2], Access::lastGuid(fixture.handler()));
 }
 
-// ------------------------------------------------------------ text bounds
-
-TEST(TextBounds, InlineTextsFillingTheirFieldAreReadWithinIt)
+TEST(TextBounds, TextsFillingTheirFieldOrShortStampsAreReadWithinThem)
 {
     HandlerFixture fixture(HTTP_ON);
-    TableBuilder b(2);
+    TableBuilder b(5);
     makePage(b, 0);
-    makeMedia(b, 1, "MSVD", 0, 0, 0);
-    for (int i = 0; i < 2; ++i) {
-        ZUB_RESPONSE_TIME_DATA& e = b.entry(i);
-        setField(e.stampText, "ABCD2024-03-05T12:34:56.7890123X");  // 32, no NUL
-        setField(e.textA, std::string(40, 'A'));
-        setField(e.textB, std::string(16, 'B'));
-        setField(e.textC, std::string(24, 'C'));
-    }
-    // Full fields holding the delimiter, followed by an int whose bytes are
-    // all the delimiter: substitution must stop at the field's end.
-    ZUB_HTTP_DETAIL& http = b.entry(0).detail.view.http;
-    setField(http.httpText, "^" + std::string(30, 'h') + "^");
-    http.httpInt0 = 0x5E5E5E5E;
-    ZUB_MEDIA_DETAIL& media = b.entry(1).detail.view.media;
-    setField(media.mediaText, "^" + std::string(30, 'm') + "^");
-    media.mediaInt0 = 0x5E5E5E5E;
-
+    makeMedia(b, 1, "MSVD", 0x5E5E5E5E);
+    ZUB_RESPONSE_TIME_DATA& e = b.entry(0);
+    setField(e.stampText, "ABCD2024-03-05T12:34:56.7890123X");  // all 32 characters, no NUL
+    setField(e.textA, std::string(40, 'A'));
+    setField(e.textB, std::string(16, 'B'));
+    setField(e.textC, std::string(24, 'C'));
+    // Full texts holding the delimiter, each followed by a number whose bytes are all the delimiter.
+    setField(e.detail.view.http.httpText, "^" + std::string(30, 'h') + "^");
+    e.detail.view.http.httpInt0 = 0x5E5E5E5E;
+    setField(b.entry(1).detail.view.media.mediaText, "^" + std::string(30, 'm') + "^");
+    const char* const stamps[][2] = {{"ABCD2024-03-05T1", "2024-03-05^1"}, {"ABCD2024", "2024^"}, {"", "^"}};
+    for (int i = 2; i < 5; ++i)
+        setField(makeEntry(b, i, "MSVD", 0).stampText, stamps[i - 2][0]);
     fixture.handler().processHttp(b.table());
     fixture.handler().processVideo(b.table());
 
-    const std::string common = "4000000000^2024-03-05^12:34:56^-7^" + std::string(40, 'A') + "^" +
-                               std::string(16, 'B') + "^65535^" + std::string(24, 'C') +
-                               "^8080^1^2^3^4^-5^100^-200^2147483647^";
-    const std::string httpText = "_" + std::string(30, 'h') + "_";
-    const std::string mediaText = "_" + std::string(30, 'm') + "_";
-    EXPECT_EQ(header("hpage", GUID0) + common +
-                  "http://www.example.com:8080/shop/cart.html^GET^200^text/html^" + httpText +
-                  "^11^12^13^14^18^19^20^21^22^17^16^15^www.example.com^/shop/cart.html^cart.html^item=7^top^Cart^"
-                  "1583242846</hpage>\n" +
-                  header("video", GUID1) + common + "5^N/A^N/A^N/A^N/A^" + mediaText + "^1583242846^0^0</video>\n",
-              fixture.log());
-    EXPECT_EQ(0x5E5E5E5E, http.httpInt0);
-    EXPECT_EQ(0x5E5E5E5E, media.mediaInt0);
-}
-
-struct StampCase {
-    const char* stamp;
-    const char* date;
-    const char* time;
-};
-
-TEST(TextBounds, StampCuts)
-{
-    const StampCase cases[] = {
-        {"ABCD2024-03-05T12:34:56", "2024-03-05", "12:34:56"},
-        {"ABCD2024-03-05T12:34:56.789012", "2024-03-05", "12:34:56"},
-        {"ABCD2024-03-05T", "2024-03-05", ""},
-        {"ABCD2024-03-05", "2024-03-05", ""},
-        {"ABCD2024", "2024", ""},
-        {"ABCD", "", ""},
-        {"AB", "", ""},
-        {"", "", ""},
-        {"ABCD2024-03-05T1", "2024-03-05", "1"},
-    };
-    for (const StampCase& c : cases) {
-        SCOPED_TRACE(std::string("stamp <") + c.stamp + ">");
-        HandlerFixture fixture;
-        TableBuilder b(1);
-        makeMedia(b, 0, "MSVD", 1, 2, 3);
-        setField(b.entry(0).stampText, c.stamp);
-        fixture.handler().processVideo(b.table());
-        EXPECT_EQ(header("video", GUID0) + "4000000000^" + c.date + "^" + c.time +
-                      "^-7^client-a^srv-b^65535^proxy-c^8080^1^2^3^4^-5^100^-200^2147483647^"
-                      "5^N/A^N/A^N/A^N/A^N/A^1^2^3</video>\n",
-                  fixture.log());
-    }
-}
-
-TEST(TextBounds, OverLongRecordsAreWrittenWhole)
-{
-    HandlerFixture fixture(HTTP_ON);
-    const std::string name(40000, 'a');
-    TableBuilder b(2, 100000);
-    makeObject(b, 0, "http://h/" + name + ".html", 7);
-    makeMedia(b, 1, "MSVD", 1, 2, 3);
-    b.setText(1, b.entry(1).detail.detailText1, std::string(50000, 'b'));
-    TraceCapture trace(TRC_ERROR);
-    fixture.handler().processHttp(b.table());
-    fixture.handler().processVideo(b.table());
-
-    const std::string expected =
-        header("hobj", GUID0) + COMMON + "http://h/" + name + ".html^N/A^N/A^N/A^N/A^0^0^0^0^0^0^0^0^0^0^0^0^h^/" +
-        name + ".html^" + name + ".html^N/A^N/A^N/A^7</hobj>\n" + header("video", GUID1) + COMMON + "5^N/A^" +
-        std::string(50000, 'b') + "^N/A^N/A^N/A^1^2^3</video>\n";
+    std::string page = PAGE_TO_TITLE + "Cart^1583242846";
+    page.replace(page.find("keep-alive"), 10, "_" + std::string(30, 'h') + "_");
+    std::string expected = line("hpage", GUID[0], page,
+                                "4000000000^2024-03-05^12:34:56^-7^" + std::string(40, 'A') + "^" +
+                                    std::string(16, 'B') + "^65535^" + std::string(24, 'C') +
+                                    "^8080^1^2^3^4^-5^100^-200^2147483647^") +
+                           line("video", GUID[1], "5^N/A^N/A^N/A^N/A^_" + std::string(30, 'm') + "_^1583242846^0^0");
+    for (int i = 2; i < 5; ++i)
+        expected += videoLine(GUID[i], "0^0^0", "4000000000^" + std::string(stamps[i - 2][1]) + COMMON_TAIL);
     EXPECT_EQ(expected, fixture.log());
-    EXPECT_TRUE(trace.lines().empty());
 }
 
-TEST(TextBounds, RecordsAroundTheBufferSize)
+TEST(TextBounds, RecordsAroundAndBeyondTheBufferAreWrittenWhole)
 {
-    // A video record whose url column is filled so that the whole record
-    // is exactly `length` bytes.
-    const std::string before = header("video", GUID0) + COMMON + "5^";
-    const std::string after = "^N/A^N/A^N/A^N/A^1^2^3</video>\n";
-    for (size_t length : {size_t(32766), size_t(32767), size_t(32768), size_t(32769)}) {
-        SCOPED_TRACE("record length " + std::to_string(length));
-        HandlerFixture fixture;
-        const std::string url(length - before.size() - after.size(), 'u');
-        TableBuilder b(1, 40000);
-        makeMedia(b, 0, "MSVD", 1, 2, 3);
-        b.setText(0, b.entry(0).detail.url, url);
-        fixture.handler().processVideo(b.table());
-        const std::string log = fixture.log();
-        EXPECT_EQ(length, log.size());
-        EXPECT_EQ(before + url + after, log);
+    // Records of `length` bytes, reached through detailText1.
+    const struct { std::string tag; size_t length; } rows[] = {
+        {"video", 32767}, {"video", 32768}, {"video", 32769}, {"hobj", 32768}, {"hobj", 90000}};
+    for (const auto& r : rows) {
+        SCOPED_TRACE(r.tag + " record of " + std::to_string(r.length) + " bytes");
+        HandlerFixture fixture(HTTP_ON);
+        const bool video = r.tag == "video";
+        const std::string head = "<" + r.tag + ">v121^92^0^wq5coll^" + GUID[0] + "^" + COMMON +
+                                 (video ? "5^N/A^" : "http://h/1^");
+        const std::string tail = (video ? "^N/A^N/A^N/A^1^2^3</video>\n"
+                                        : "^N/A^N/A^N/A^0^0^0^0^0^0^0^0^0^0^0^0^h^/1^1^N/A^N/A^N/A^1</hobj>\n");
+        const std::string pad(r.length - head.size() - tail.size(), 'x');
+        TableBuilder b(1, r.length);
+        video ? makeMedia(b, 0, "MSVD", 1, 2, 3) : makeObject(b, 0, 1);
+        b.setText(0, b.entry(0).detail.detailText1, pad);
+        TraceCapture trace(TRC_ERROR);
+        video ? fixture.handler().processVideo(b.table()) : fixture.handler().processHttp(b.table());
+        EXPECT_EQ(head + pad + tail, fixture.log());
+        EXPECT_TRUE(trace.lines().empty());
     }
 }
 
-// ------------------------------------------------------------ pieces
-
-TEST(RecordPieces, NullArgumentsWriteNothing)
+TEST(Guid, MadeOfItsPartsCutAfter64CharactersCounterWraps)
 {
-    DataHandler handler(nullptr);
-    char buffer[8] = "xxxxxxx";
-    ZUB_RESPONSE_TIME_DATA entry;
-    memset(&entry, 0, sizeof(entry));
-    EXPECT_EQ(0, handler.addHeader(nullptr, 8, "hpage", "g"));
-    EXPECT_EQ(0, handler.addHeader(buffer, 8, nullptr, "g"));
-    EXPECT_EQ(0, handler.addCommon(nullptr, 8, &entry));
-    EXPECT_EQ(0, handler.addCommon(buffer, 8, nullptr));
-    EXPECT_EQ(0, handler.addHttpMain(nullptr, 8, &entry));
-    EXPECT_EQ(0, handler.addHttpMain(buffer, 8, nullptr));
-    EXPECT_EQ(0, handler.addHttpObj(buffer, 8, nullptr));
-    EXPECT_EQ(0, handler.addHttpSummary(buffer, 8, nullptr));
-    EXPECT_EQ(0, handler.addFooter(nullptr, 8, "hobj"));
-    EXPECT_EQ(0, handler.addFooter(buffer, 8, nullptr));
-    EXPECT_STREQ("xxxxxxx", buffer);
-}
-
-TEST(RecordPieces, HeaderAndFooter)
-{
-    HandlerFixture fixture;
-    char buffer[128];
-    const std::string head = "<hpage>v121^92^0^wq5coll^" + std::string(GUID0) + "^";
-    EXPECT_EQ(static_cast<int>(head.size()), fixture.handler().addHeader(buffer, sizeof(buffer), TAG_HTTPPAGE, GUID0));
-    EXPECT_EQ(head, buffer);
-    EXPECT_EQ(8, fixture.handler().addFooter(buffer, sizeof(buffer), TAG_HTTPOBJ));
-    EXPECT_STREQ("</hobj>\n", buffer);
-}
-
-TEST(RecordPieces, APieceThatDoesNotFitIsMeasuredNotOverrun)
-{
-    HandlerFixture fixture;
-    char buffer[16];
-    memset(buffer, '#', sizeof(buffer));
-    EXPECT_EQ(8, fixture.handler().addFooter(buffer, 4, TAG_HTTPOBJ));
-    EXPECT_STREQ("</h", buffer);
-    EXPECT_EQ('#', buffer[4]);
-}
-
-TEST(RecordPieces, ObjectAndSummaryColumnsAreThoseOfAPage)
-{
-    HandlerFixture fixture;
-    TableBuilder b(1);
-    makePage(b, 0);
-    char main[512], obj[512], sum[512];
-    const int n = fixture.handler().addHttpMain(main, sizeof(main), &b.entry(0));
-    EXPECT_EQ(PAGE_UP_TO_TITLE + PAGE_TAIL, main);
-    EXPECT_EQ(static_cast<int>(strlen(main)), n);
-    EXPECT_EQ(n, fixture.handler().addHttpObj(obj, sizeof(obj), &b.entry(0)));
-    EXPECT_EQ(n, fixture.handler().addHttpSummary(sum, sizeof(sum), &b.entry(0)));
-    EXPECT_STREQ(main, obj);
-    EXPECT_STREQ(main, sum);
-}
-
-struct ReplaceCase {
-    const char* text;
-    char from;
-    char to;
-    const char* expected;
-};
-
-TEST(Replace, SubstitutesEveryOccurrence)
-{
-    const ReplaceCase cases[] = {
-        {"a^b^^c", '^', '_', "a_b__c"},
-        {"abc", '^', '_', "abc"},
-        {"^", '^', '_', "_"},
-        {"", '^', '_', ""},
-        {"a^b", '^', '^', "a^b"},
-        {"x_y", '_', '-', "x-y"},
-    };
-    for (const ReplaceCase& c : cases) {
-        char text[16];
-        strcpy(text, c.text);
-        replace(text, c.from, c.to);
-        EXPECT_STREQ(c.expected, text) << "text <" << c.text << ">";
+    const std::string cut = "1a2b4d000000123400000000" + std::string(40, 'n');
+    const struct { unsigned long pid; time_t time; int random; uint32_t counter; std::string name;
+                   const char* calls; std::vector<std::string> guids; } rows[] = {  // calls: n generateGuid, l getGuid
+        {6699, 1291845632, 4660, 0, "wq5coll", "nnl", {GUID[0], GUID[1], GUID[1]}},
+        {16, 32, 48, 0, "x", "llnl", {"10203000000000x", "10203000000000x", "10203000000001x", "10203000000001x"}},
+        {1, 2, 3, 0xFFFFFFFEu, "c", "nnnn", {"123fffffffec", "123ffffffffc", "12300000000c", "12300000001c"}},
+        {6699, 1291845632, 4660, 0, std::string(100, 'n'), "nl", {cut, cut}}};
+    for (const auto& r : rows) {
+        DataHandler handler(nullptr);
+        Access::fixGuid(handler, r.pid, r.time, r.random, r.counter, r.name);
+        std::vector<std::string> guids;
+        for (const char* call = r.calls; *call != '\0'; ++call)
+            guids.push_back(*call == 'n' ? handler.generateGuid() : handler.getGuid());
+        EXPECT_EQ(r.guids, guids) << "name " << r.name.substr(0, 10) << ", calls " << r.calls;
     }
-    replace(nullptr, '^', '_');
-}
-
-TEST(Replace, NulDelimiterStopsAtTheTerminator)
-{
-    char text[] = "ab\0cd";
-    replace(text, '\0', '_');
-    EXPECT_EQ(0, memcmp(text, "ab\0cd", 6));
-    replace(text, sizeof(text), '\0', '_');
-    EXPECT_EQ(0, memcmp(text, "ab\0cd", 6));
-}
-
-TEST(Replace, BoundedFormStopsAtFieldEndOrTerminator)
-{
-    char text[] = "^^^^^^";
-    replace(text, 4, '^', '_');
-    EXPECT_STREQ("____^^", text);
-    char early[] = "^\0^^";
-    replace(early, 4, '^', '_');
-    EXPECT_EQ(0, memcmp(early, "_\0^^", 5));
-    replace(nullptr, 4, '^', '_');
-}
-
-TEST(TypeLookup, IndexOfEveryCode)
-{
-    const struct {
-        const char* code;
-        int index;
-    } cases[] = {
-        {"HTTP", 4}, {"MSVD", 5}, {"REAL", 6}, {"QTIM", 7},  {"QOLB", 8},  {"MSAU", 9},  {"RLAU", 10},
-        {"QOLC", 11}, {"MALR", 12}, {"PKTS", 13}, {"CTXT", 14}, {"STAT", 15}, {"NONE", 0}, {"TCP ", 0},
-        {"UDP ", 0}, {"http", 0},  {"MSV", 0},  {"", 0},     {"XXXX", 0},
-        // Only four characters count.
-        {"MSVDX", 5},
-    };
-    for (const auto& c : cases)
-        EXPECT_EQ(c.index, typeLookup(c.code)) << "code <" << c.code << ">";
-    EXPECT_EQ(0, typeLookup(nullptr));
-    const char unterminated[4] = {'R', 'L', 'A', 'U'};
-    EXPECT_EQ(10, typeLookup(unterminated));
-}
-
-// ------------------------------------------------------------ GUID
-
-TEST(Guid, WorkedExample)
-{
-    DataHandler handler(nullptr);
-    Access::fixGuid(handler, 6699, 1291845632, 4660, 0, "wq5coll");
-    EXPECT_EQ("1a2b4d000000123400000000wq5coll", handler.generateGuid());
-    EXPECT_EQ("1a2b4d000000123400000001wq5coll", handler.generateGuid());
-    EXPECT_EQ("1a2b4d000000123400000001wq5coll", handler.getGuid());
-}
-
-TEST(Guid, CutAfterSixtyFourCharacters)
-{
-    DataHandler handler(nullptr);
-    Access::fixGuid(handler, 6699, 1291845632, 4660, 0, std::string(100, 'n'));
-    const std::string guid = handler.generateGuid();
-    EXPECT_EQ("1a2b4d000000123400000000" + std::string(40, 'n'), guid);
-    EXPECT_EQ(guid, handler.getGuid());
-}
-
-TEST(Guid, CounterWrapsToZero)
-{
-    DataHandler handler(nullptr);
-    Access::fixGuid(handler, 1, 2, 3, 0xFFFFFFFEu, "c");
-    EXPECT_EQ("123fffffffec", handler.generateGuid());
-    EXPECT_EQ("123ffffffffc", handler.generateGuid());
-    EXPECT_EQ("12300000000c", handler.generateGuid());
-    EXPECT_EQ("12300000001c", handler.generateGuid());
-}
-
-TEST(Guid, GetGuidMakesOneOnlyWhenThereIsNone)
-{
-    DataHandler handler(nullptr);
-    Access::fixGuid(handler, 0x10, 0x20, 0x30, 0, "x");
-    EXPECT_EQ("10203000000000x", handler.getGuid());
-    EXPECT_EQ("10203000000000x", handler.getGuid());
-    EXPECT_EQ("10203000000001x", handler.generateGuid());
-    EXPECT_EQ("10203000000001x", handler.getGuid());
 }
 
 }  // namespace

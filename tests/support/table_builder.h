@@ -52,14 +52,7 @@ public:
     }
 
     // Points (or unpoints) the table's `entries` at the first entry.
-    void setEntriesRef(bool present)
-    {
-#if ZUB_REF_IS_OFFSET
-        table()->entries = present ? static_cast<ZUB_REF>(HEADER) : 0;
-#else
-        table()->entries = present ? base() + HEADER : nullptr;
-#endif
-    }
+    void setEntriesRef(bool present) { table()->entries = present ? refTo(table(), base() + HEADER) : 0; }
 
     // Stores `text` (and its NUL) behind the entries and sets `ref`, a
     // reference field of entry `i`, to it. Returns the stored copy, which
@@ -72,12 +65,7 @@ public:
         char* copy = base() + m_textUsed;
         memcpy(copy, text.c_str(), need);
         m_textUsed += need;
-#if ZUB_REF_IS_OFFSET
-        ref = static_cast<ZUB_REF>(copy - reinterpret_cast<char*>(&entry(i)));
-#else
-        (void)i;
-        ref = copy;
-#endif
+        ref = refTo(&entry(i), copy);
         return copy;
     }
 
@@ -87,6 +75,16 @@ private:
     static const size_t HEADER = sizeof(ZUB_RESPONSE_TIME_DATA_TABLE);
 
     char* base() { return reinterpret_cast<char*>(m_block.data()); }
+    // A reference to `target` from the record at `from`.
+    static ZUB_REF refTo(const void* from, char* target)
+    {
+#if ZUB_REF_IS_OFFSET
+        return static_cast<ZUB_REF>(target - static_cast<const char*>(from));
+#else
+        (void)from;
+        return target;
+#endif
+    }
 
     int m_count;
     std::vector<uint64_t> m_block;  // 8-byte aligned, never reallocated

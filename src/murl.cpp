@@ -2,6 +2,7 @@
 
 #include <climits>
 #include <cstdlib>
+#include <cstring>
 
 namespace {
 
@@ -26,6 +27,20 @@ int portNumber(const std::string& text)
     return static_cast<int>(value);
 }
 
+// The first `c` at or after `from` in the text, or NONE.
+std::string::size_type find(const char* text, size_t length, char c, size_t from)
+{
+    if (from >= length)
+        return NONE;
+    const void* at = memchr(text + from, c, length - from);
+    return at == nullptr ? NONE : static_cast<size_t>(static_cast<const char*>(at) - text);
+}
+
+Wq5UrlSplit::Span span(size_t start, size_t end)
+{
+    return Wq5UrlSplit::Span{start, end - start};
+}
+
 }  // namespace
 
 Wq5Url::Wq5Url(const std::string& url) : m_url(url), m_port(-1)
@@ -43,12 +58,14 @@ Wq5Url::Wq5Url(const char* url) : m_port(-1)
 
 Wq5Url::~Wq5Url() {}
 
-void Wq5Url::parse(const std::string& text)
+Wq5UrlSplit splitUrl(const char* text, size_t length)
 {
-    const std::string::size_type end = text.size();
+    const std::string::size_type end = length;
+    Wq5UrlSplit split = {};
 
     // The partial form keeps the raw text, leading blanks included.
-    m_partialForm = text.substr(0, text.find('?'));
+    const std::string::size_type firstQuery = find(text, length, '?', 0);
+    split.partialForm = span(0, firstQuery == NONE ? end : firstQuery);
 
     std::string::size_type cursor = 0;
     while (cursor < end && isBlank(text[cursor]))
@@ -56,7 +73,7 @@ void Wq5Url::parse(const std::string& text)
 
     // The first ':' anywhere in the rest ends the scheme, even one that
     // belongs to a port or a query.
-    const std::string::size_type schemeColon = text.find(':', cursor);
+    const std::string::size_type schemeColon = find(text, length, ':', cursor);
     if (schemeColon != NONE)
         cursor = schemeColon + 1;
 
@@ -66,7 +83,7 @@ void Wq5Url::parse(const std::string& text)
         authority = cursor;
         cursor += 2;
         // Any later '/' starts the path, even one inside the query.
-        const std::string::size_type slash = text.find('/', cursor);
+        const std::string::size_type slash = find(text, length, '/', cursor);
         if (slash != NONE) {
             pathStart = slash;
             cursor = slash + 1;
@@ -75,12 +92,12 @@ void Wq5Url::parse(const std::string& text)
         pathStart = cursor;
     }
 
-    std::string::size_type queryMark = text.find('?', cursor);
+    std::string::size_type queryMark = find(text, length, '?', cursor);
     if (queryMark != NONE)
         cursor = queryMark + 1;
     // A '#' counts only after the '?' (or after the path start when there
     // is no '?'); one in front of the '?' stays in the path.
-    std::string::size_type refMark = text.find('#', cursor);
+    std::string::size_type refMark = find(text, length, '#', cursor);
     if (refMark == NONE)
         refMark = end;
     if (queryMark == NONE)
@@ -105,19 +122,32 @@ void Wq5Url::parse(const std::string& text)
         --fileStart;
 
     if (schemeColon != NONE)
-        m_scheme = text.substr(0, schemeColon);
-    if (authority != NONE) {
-        const std::string::size_type hostEnd = portColon != NONE ? portColon : pathStart;
-        m_host = text.substr(authority + 2, hostEnd - (authority + 2));
-    }
-    if (pathStart != queryMark)
-        m_path = text.substr(pathStart, queryMark - pathStart);
-    if (fileStart != queryMark)
-        m_file = text.substr(fileStart, queryMark - fileStart);
+        split.scheme = span(0, schemeColon);
+    if (authority != NONE)
+        split.host = span(authority + 2, portColon != NONE ? portColon : pathStart);
+    split.path = span(pathStart, queryMark);
+    split.file = span(fileStart, queryMark);
     if (queryMark != refMark)
-        m_query = text.substr(queryMark + 1, refMark - (queryMark + 1));
+        split.query = span(queryMark + 1, refMark);
     if (refMark != end)
-        m_ref = text.substr(refMark + 1);
-    if (portColon != NONE)
-        m_port = portNumber(text.substr(portColon + 1, pathStart - (portColon + 1)));
+        split.ref = span(refMark + 1, end);
+    if (portColon != NONE) {
+        split.port = span(portColon + 1, pathStart);
+        split.hasPort = true;
+    }
+    return split;
+}
+
+void Wq5Url::parse(const std::string& text)
+{
+    const Wq5UrlSplit split = splitUrl(text.data(), text.size());
+    m_partialForm.assign(text, split.partialForm.start, split.partialForm.length);
+    m_scheme.assign(text, split.scheme.start, split.scheme.length);
+    m_host.assign(text, split.host.start, split.host.length);
+    m_path.assign(text, split.path.start, split.path.length);
+    m_file.assign(text, split.file.start, split.file.length);
+    m_query.assign(text, split.query.start, split.query.length);
+    m_ref.assign(text, split.ref.start, split.ref.length);
+    if (split.hasPort)
+        m_port = portNumber(text.substr(split.port.start, split.port.length));
 }

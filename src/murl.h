@@ -9,7 +9,23 @@
 #ifndef WQ5_MURL_H
 #define WQ5_MURL_H
 
+#include <cstddef>
 #include <string>
+
+// Where the parts lie within a URL text of `length` bytes: the split that
+// Wq5Url copies its parts from, for a caller that only reads the parts
+// while the text lives (the record formatting, without a copy per part).
+// An absent part has length 0; `hasPort` tells whether there is a port
+// text (`port`, to be read as atoi does).
+struct Wq5UrlSplit {
+    struct Span {
+        size_t start;
+        size_t length;
+    };
+    Span partialForm, scheme, host, path, file, query, ref, port;
+    bool hasPort;
+};
+Wq5UrlSplit splitUrl(const char* text, size_t length);
 
 class Wq5Url {
 public:
@@ -31,8 +47,8 @@ public:
     const std::string& getPartialForm() const { return m_partialForm; }
 
 private:
-    // Fills the parts from `text`; runs once, on an object whose parts are
-    // still empty.
+    // Fills the parts from `text` (splitUrl); runs once, on an object whose
+    // parts are still empty.
     void parse(const std::string& text);
 
     std::string m_url;

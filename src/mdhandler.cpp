@@ -1,6 +1,7 @@
 #include "mdhandler.h"
 
 #include <cerrno>
+#include <climits>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -38,11 +39,6 @@ const char* orNA(const char* text)
     return text != nullptr && text[0] != '\0' ? text : NA;
 }
 
-const char* orNA(const std::string& text)
-{
-    return text.empty() ? NA : text.c_str();
-}
-
 // Length of an inline text that may fill its field without a terminator,
 // as a printf precision.
 template <size_t N>
@@ -72,6 +68,134 @@ size_t roomAt(size_t size, size_t used)
 {
     return used < size ? size - used : 0;
 }
+
+// One piece of a record, written as snprintf writes: at most `size` bytes,
+// the last of them a NUL, while the length of the whole piece is counted
+// on past the end, so that the caller can tell a cut piece and make room.
+// Every column is a text or a decimal number; appending them directly
+// instead of interpreting a format string per record is what keeps the
+// formatting a small part of a record's cost next to its write.
+class Piece {
+public:
+    Piece(char* buffer, size_t size)
+        : m_at(buffer), m_room(size > 0 ? size - 1 : 0), m_terminate(size > 0), m_length(0)
+    {
+    }
+
+    // `length` characters of `text` ("%.*s" for a text without a NUL in
+    // them).
+    Piece& text(const char* text, size_t length)
+    {
+        if (length <= m_room) {
+            copy(m_at, text, length);
+            m_at += length;
+            m_room -= length;
+        } else {
+            // Cut: the rest is only counted.
+            if (m_room > 0)
+                memcpy(m_at, text, m_room);
+            m_at += m_room;
+            m_room = 0;
+        }
+        m_length += length;
+        return *this;
+    }
+    // "%s"
+    Piece& text(const char* text) { return this->text(text, strlen(text)); }
+    // "%s" of a part of `whole`, or of "N/A" when the part is empty.
+    Piece& textOrNA(const char* whole, Wq5UrlSplit::Span part)
+    {
+        if (part.length == 0)
+            return text(NA, sizeof NA - 1);
+        return text(whole + part.start, part.length);
+    }
+    // "%c"
+    Piece& ch(char c)
+    {
+        if (m_room > 0) {
+            *m_at++ = c;
+            --m_room;
+        }
+        ++m_length;
+        return *this;
+    }
+    // "%d", "%ld", "%u", "%lu"
+    Piece& number(int64_t value)
+    {
+        if (value < 0) {
+            ch('-');
+            return digits(0 - static_cast<uint64_t>(value));
+        }
+        return digits(static_cast<uint64_t>(value));
+    }
+
+    // Terminates the piece; its whole length, or -1 when that is beyond
+    // what an int holds (snprintf fails then too).
+    int end()
+    {
+        if (m_terminate)
+            *m_at = '\0';
+        return m_length > static_cast<size_t>(INT_MAX) ? -1 : static_cast<int>(m_length);
+    }
+
+private:
+    Piece& digits(uint64_t value)
+    {
+        // Two digits per division, from the end of a scratch buffer.
+        static const char PAIRS[] =
+            "00010203040506070809101112131415161718192021222324252627282930313233343536373839"
+            "40414243444546474849505152535455565758596061626364656667686970717273747576777879"
+            "8081828384858687888990919293949596979899";
+        char scratch[20];
+        char* first = scratch + sizeof scratch;
+        while (value >= 100) {
+            first -= 2;
+            memcpy(first, PAIRS + 2 * (value % 100), 2);
+            value /= 100;
+        }
+        if (value >= 10) {
+            first -= 2;
+            memcpy(first, PAIRS + 2 * value, 2);
+        } else {
+            *--first = static_cast<char>('0' + value);
+        }
+        const size_t count = static_cast<size_t>(scratch + sizeof scratch - first);
+        if (count > m_room)
+            return text(first, count);
+        for (size_t i = 0; i < count; ++i)
+            m_at[i] = first[i];
+        m_at += count;
+        m_room -= count;
+        m_length += count;
+        return *this;
+    }
+
+    // Most columns are a few characters long: copied with fixed-size
+    // moves (two overlapping ones) instead of a call per column.
+    static void copy(char* to, const char* from, size_t length)
+    {
+        if (length > 32) {
+            memcpy(to, from, length);
+        } else if (length >= 16) {
+            memcpy(to, from, 16);
+            memcpy(to + length - 16, from + length - 16, 16);
+        } else if (length >= 8) {
+            memcpy(to, from, 8);
+            memcpy(to + length - 8, from + length - 8, 8);
+        } else if (length >= 4) {
+            memcpy(to, from, 4);
+            memcpy(to + length - 4, from + length - 4, 4);
+        } else {
+            for (size_t i = 0; i < length; ++i)
+                to[i] = from[i];
+        }
+    }
+
+    char* m_at;
+    size_t m_room;  // characters that still fit before the NUL
+    bool m_terminate;
+    size_t m_length;
+};
 
 }  // namespace
 
@@ -299,8 +423,15 @@ int DataHandler::addHeader(char* buffer, size_t size, const char* tag, const std
     if (buffer == nullptr || tag == nullptr)
         return 0;
     const char d = m_delimiter;
-    return snprintf(buffer, size, "<%s>%s%c%d%c0%c%s%c%s%c", tag, m_version.c_str(), d, WEBMEDIA_APPL_ID, d, d,
-                    m_name.c_str(), d, guid.c_str(), d);
+    // "<%s>%s%c%d%c0%c%s%c%s%c"
+    return Piece(buffer, size)
+        .ch('<').text(tag).ch('>')
+        .text(m_version.c_str()).ch(d)
+        .number(WEBMEDIA_APPL_ID).ch(d)
+        .ch('0').ch(d)
+        .text(m_name.c_str()).ch(d)
+        .text(guid.c_str()).ch(d)
+        .end();
 }
 
 int DataHandler::addCommon(char* buffer, size_t size, ZUB_RESPONSE_TIME_DATA* entry)
@@ -312,17 +443,26 @@ int DataHandler::addCommon(char* buffer, size_t size, ZUB_RESPONSE_TIME_DATA* en
     // position 4 and up to 8 from position 15; a short stamp gives what
     // is there.
     const int stampLength = fieldLength(entry->stampText);
-    return snprintf(buffer, size,
-                    "%lu%c%.*s%c%.*s%c%d%c%.*s%c%.*s%c%u%c%.*s%c%u%c%d%c%d%c%d%c%d%c%d%c%ld%c%ld%c%ld%c",
-                    static_cast<unsigned long>(entry->ulongValue), d, cutLength(stampLength, 4, 10),
-                    entry->stampText + 4, d, cutLength(stampLength, 15, 8), entry->stampText + 15, d,
-                    static_cast<int>(entry->intValue), d, fieldLength(entry->textA), entry->textA, d,
-                    fieldLength(entry->textB), entry->textB, d, static_cast<unsigned>(entry->ushortA), d,
-                    fieldLength(entry->textC), entry->textC, d, static_cast<unsigned>(entry->ushortB), d,
-                    static_cast<int>(entry->intMetric1), d, static_cast<int>(entry->intMetric2), d,
-                    static_cast<int>(entry->intMetric3), d, static_cast<int>(entry->intMetric4), d,
-                    static_cast<int>(entry->intMetric5), d, static_cast<long>(entry->longMetric1), d,
-                    static_cast<long>(entry->longMetric2), d, static_cast<long>(entry->longMetric3), d);
+    // "%lu%c%.*s%c%.*s%c%d%c%.*s%c%.*s%c%u%c%.*s%c%u%c%d%c%d%c%d%c%d%c%d%c%ld%c%ld%c%ld%c"
+    return Piece(buffer, size)
+        .number(entry->ulongValue).ch(d)
+        .text(entry->stampText + 4, static_cast<size_t>(cutLength(stampLength, 4, 10))).ch(d)
+        .text(entry->stampText + 15, static_cast<size_t>(cutLength(stampLength, 15, 8))).ch(d)
+        .number(entry->intValue).ch(d)
+        .text(entry->textA, static_cast<size_t>(fieldLength(entry->textA))).ch(d)
+        .text(entry->textB, static_cast<size_t>(fieldLength(entry->textB))).ch(d)
+        .number(entry->ushortA).ch(d)
+        .text(entry->textC, static_cast<size_t>(fieldLength(entry->textC))).ch(d)
+        .number(entry->ushortB).ch(d)
+        .number(entry->intMetric1).ch(d)
+        .number(entry->intMetric2).ch(d)
+        .number(entry->intMetric3).ch(d)
+        .number(entry->intMetric4).ch(d)
+        .number(entry->intMetric5).ch(d)
+        .number(entry->longMetric1).ch(d)
+        .number(entry->longMetric2).ch(d)
+        .number(entry->longMetric3).ch(d)
+        .end();
 }
 
 int DataHandler::addHttpMain(char* buffer, size_t size, ZUB_RESPONSE_TIME_DATA* entry)
@@ -345,7 +485,10 @@ int DataHandler::addHttpMain(char* buffer, size_t size, ZUB_RESPONSE_TIME_DATA* 
     replace(http.httpText, sizeof(http.httpText), d, m_subChar);
     replace(title, d, m_subChar);
 
-    const Wq5Url parts(url);
+    // The parts are read straight out of the URL text; it outlives the
+    // record.
+    const size_t urlLength = url != nullptr ? strlen(url) : 0;
+    const Wq5UrlSplit parts = splitUrl(url != nullptr ? url : "", urlLength);
 
     // Compared after the substitution: when '_' is the delimiter, the
     // marker no longer reads NO_TITLE_FOUND and is written as a title.
@@ -354,20 +497,37 @@ int DataHandler::addHttpMain(char* buffer, size_t size, ZUB_RESPONSE_TIME_DATA* 
         titleText = NA;
 
     const int httpTextLength = fieldLength(http.httpText);
-    const char* httpText = httpTextLength > 0 ? http.httpText : NA;
-    const int httpTextShown = httpTextLength > 0 ? httpTextLength : static_cast<int>(sizeof(NA) - 1);
 
-    return snprintf(buffer, size,
-                    "%s%c%s%c%s%c%s%c%.*s%c%d%c%d%c%d%c%d%c%d%c%d%c%d%c%d%c%d%c%d%c%d%c%d%c%s%c%s%c%s%c%s%c%s%c%s%c%d",
-                    orNA(parts.getPartialForm()), d, orNA(text1), d, orNA(text2), d, orNA(text3), d, httpTextShown,
-                    httpText, d, static_cast<int>(http.httpInt1), d, static_cast<int>(http.httpInt2), d,
-                    static_cast<int>(http.httpInt3), d, static_cast<int>(http.httpInt4), d,
-                    static_cast<int>(http.httpInt8), d, static_cast<int>(http.httpInt9), d,
-                    static_cast<int>(http.httpInt10), d, static_cast<int>(http.httpInt11), d,
-                    static_cast<int>(http.httpInt12), d, static_cast<int>(http.httpInt7), d,
-                    static_cast<int>(http.httpInt6), d, static_cast<int>(http.httpInt5), d, orNA(parts.getHost()), d,
-                    orNA(parts.getPath()), d, orNA(parts.getFile()), d, orNA(parts.getQuery()), d,
-                    orNA(parts.getRef()), d, titleText, d, static_cast<int>(http.httpInt0));
+    // "%s%c%s%c%s%c%s%c%s%c%d%c%d%c%d%c%d%c%d%c%d%c%d%c%d%c%d%c%d%c%d%c%d%c%s%c%s%c%s%c%s%c%s%c%s%c%d"
+    Piece piece(buffer, size);
+    piece.textOrNA(url, parts.partialForm).ch(d)
+        .text(orNA(text1)).ch(d)
+        .text(orNA(text2)).ch(d)
+        .text(orNA(text3)).ch(d);
+    if (httpTextLength > 0)
+        piece.text(http.httpText, static_cast<size_t>(httpTextLength)).ch(d);
+    else
+        piece.text(NA).ch(d);
+    return piece.number(http.httpInt1).ch(d)
+        .number(http.httpInt2).ch(d)
+        .number(http.httpInt3).ch(d)
+        .number(http.httpInt4).ch(d)
+        .number(http.httpInt8).ch(d)
+        .number(http.httpInt9).ch(d)
+        .number(http.httpInt10).ch(d)
+        .number(http.httpInt11).ch(d)
+        .number(http.httpInt12).ch(d)
+        .number(http.httpInt7).ch(d)
+        .number(http.httpInt6).ch(d)
+        .number(http.httpInt5).ch(d)
+        .textOrNA(url, parts.host).ch(d)
+        .textOrNA(url, parts.path).ch(d)
+        .textOrNA(url, parts.file).ch(d)
+        .textOrNA(url, parts.query).ch(d)
+        .textOrNA(url, parts.ref).ch(d)
+        .text(titleText).ch(d)
+        .number(http.httpInt0)
+        .end();
 }
 
 int DataHandler::addHttpObj(char* buffer, size_t size, ZUB_RESPONSE_TIME_DATA* entry)
@@ -388,20 +548,29 @@ int DataHandler::addMedia(char* buffer, size_t size, ZUB_RESPONSE_TIME_DATA* ent
     const ZUB_MEDIA_DETAIL& media = detail.view.media;
     const char d = m_delimiter;
     const int mediaTextLength = fieldLength(media.mediaText);
-    const char* mediaText = mediaTextLength > 0 ? media.mediaText : NA;
-    const int mediaTextShown = mediaTextLength > 0 ? mediaTextLength : static_cast<int>(sizeof(NA) - 1);
-    return snprintf(buffer, size, "%d%c%s%c%s%c%s%c%s%c%.*s%c%d%c%d%c%d", typeLookup(entry->rdType), d,
-                    orNA(zubText(entry, detail.url)), d, orNA(zubText(entry, detail.detailText1)), d,
-                    orNA(zubText(entry, detail.detailText2)), d, orNA(zubText(entry, detail.detailText3)), d,
-                    mediaTextShown, mediaText, d, static_cast<int>(media.mediaInt0), d,
-                    static_cast<int>(media.mediaInt1), d, static_cast<int>(media.mediaInt2));
+
+    // "%d%c%s%c%s%c%s%c%s%c%s%c%d%c%d%c%d"
+    Piece piece(buffer, size);
+    piece.number(typeLookup(entry->rdType)).ch(d)
+        .text(orNA(zubText(entry, detail.url))).ch(d)
+        .text(orNA(zubText(entry, detail.detailText1))).ch(d)
+        .text(orNA(zubText(entry, detail.detailText2))).ch(d)
+        .text(orNA(zubText(entry, detail.detailText3))).ch(d);
+    if (mediaTextLength > 0)
+        piece.text(media.mediaText, static_cast<size_t>(mediaTextLength)).ch(d);
+    else
+        piece.text(NA).ch(d);
+    return piece.number(media.mediaInt0).ch(d)
+        .number(media.mediaInt1).ch(d)
+        .number(media.mediaInt2)
+        .end();
 }
 
 int DataHandler::addFooter(char* buffer, size_t size, const char* tag)
 {
     if (buffer == nullptr || tag == nullptr)
         return 0;
-    return snprintf(buffer, size, "</%s>\n", tag);
+    return Piece(buffer, size).text("</", 2).text(tag).ch('>').ch('\n').end();
 }
 
 // ------------------------------------------------------------ whole records
@@ -476,18 +645,18 @@ void DataHandler::emitRecord(TRC1_EPB* blk, int mask, char* buffer, RecordFormat
 
 void DataHandler::writeRecord(TRC1_EPB* blk, int mask, const char* record, size_t length)
 {
+    // The writer counts the dropped record and takes off whatever part of
+    // it reached the file; the reason is reported here.
     DataWriterLock lock(*m_dataWriter);
-    FILE* stream = lock.getStream();
-    if (stream == nullptr) {
-        if (mask & TRC_ERROR)
-            TRC1_Printf(blk, __LINE__, "Failed to open log file.");
+    if (lock.writeRecord(record, length))
         return;
-    }
-    if (fwrite(record, 1, length, stream) < length) {
-        const int error = errno;
-        if (mask & TRC_ERROR)
-            TRC1_Printf(blk, __LINE__, "Write to log file failed %d", error);
-    }
+    const int error = errno;
+    if (!(mask & TRC_ERROR))
+        return;
+    if (lock.getStream() == nullptr)
+        TRC1_Printf(blk, __LINE__, "Failed to open log file.");
+    else
+        TRC1_Printf(blk, __LINE__, "Write to log file failed %d", error);
 }
 
 // ------------------------------------------------------------ table walks

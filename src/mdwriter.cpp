@@ -41,6 +41,38 @@ static wq5_time_t currentTime()
     return clock ? clock() : static_cast<wq5_time_t>(time(nullptr));
 }
 
+// ---------------------------------------------------------------------------
+// Output calls
+
+static std::atomic<WriterIo::WriteCall> s_write{nullptr};
+static std::atomic<WriterIo::FlushCall> s_flush{nullptr};
+static std::atomic<WriterIo::TruncateCall> s_truncate{nullptr};
+
+void setWriterIo(const WriterIo& io)
+{
+    s_write.store(io.write, std::memory_order_release);
+    s_flush.store(io.flush, std::memory_order_release);
+    s_truncate.store(io.truncate, std::memory_order_release);
+}
+
+static size_t ioWrite(const char* data, size_t length, FILE* stream)
+{
+    const WriterIo::WriteCall call = s_write.load(std::memory_order_acquire);
+    return call ? call(data, 1, length, stream) : fwrite(data, 1, length, stream);
+}
+
+static int ioFlush(FILE* stream)
+{
+    const WriterIo::FlushCall call = s_flush.load(std::memory_order_acquire);
+    return call ? call(stream) : fflush(stream);
+}
+
+static int ioTruncate(int fd, int64_t length)
+{
+    const WriterIo::TruncateCall call = s_truncate.load(std::memory_order_acquire);
+    return call ? call(fd, length) : ftruncate64(fd, static_cast<off64_t>(length));
+}
+
 static wq5_time_t periodStartAt(wq5_time_t now, wq5_time_t period)
 {
     if (period <= 0)
@@ -303,14 +335,17 @@ DataWriter::DataWriter(const std::string& logDir, const std::string& suffix, lon
       m_maxSizeMb(maxSizeMb),
       m_openErrors(0),
       m_maxSizeBytes(megabytesToBytes(maxSizeMb)),
-      m_statusCheck(0)
+      m_fileName(),
+      m_fileSize(-1),
+      m_statusCheck(0),
+      m_cutTo(-1),
+      m_lostRecords(0)
 {
 }
 
 DataWriter::~DataWriter()
 {
-    if (m_stream != nullptr)
-        fclose(m_stream);
+    closeStream();
 }
 
 void DataWriter::setMaxSizeBytes(int64_t bytes)
@@ -320,41 +355,59 @@ void DataWriter::setMaxSizeBytes(int64_t bytes)
 
 bool DataWriter::openFileStale(wq5_time_t now)
 {
+    // With a limit the size is asked for every record. Without one, the
+    // status is asked at most once a second, to notice a removed file, and
+    // the size is otherwise kept up to date by writeRecord: a status query
+    // per record would cost as much as the write itself.
     const bool limited = m_maxSizeBytes > 0;
-    // Without a limit the only question is whether the file was removed;
-    // asking once a second keeps the record path at one clock read.
     if (!limited && now == m_statusCheck)
         return false;
     m_statusCheck = now;
-
     struct stat64 status;
-    if (fstat64(fileno(m_stream), &status) != 0)
+    if (fstat64(fileno(m_stream), &status) != 0) {
+        m_fileSize = -1;
         return false;
-    // Records written to a removed file would vanish with it.
+    }
+    m_fileSize = status.st_size;
     if (status.st_nlink == 0)
         return true;
     return limited && status.st_size > m_maxSizeBytes;
+}
+
+void DataWriter::closeStream()
+{
+    if (m_stream == nullptr)
+        return;
+    cutBack();
+    fclose(m_stream);
+    m_stream = nullptr;
+    m_cutTo = -1;
 }
 
 int DataWriter::reopen(wq5_time_t periodStart, wq5_time_t now)
 {
     const int mask = trc1Mask(&s_checkAndOpenBlock);
 
-    if (m_stream != nullptr) {
-        fclose(m_stream);
-        m_stream = nullptr;
-    }
+    closeStream();
     std::string name;
     getLogfileName(periodStart, name);
     deleteOldFiles(periodStart);
 
     m_stream = fopen64(name.c_str(), "a");
     if (m_stream != nullptr) {
+        // Unbuffered: the one fwrite of a record is one write to the file,
+        // and a failed record can never stay behind in a buffer, to reach
+        // the file later in pieces behind the records after it (a failed
+        // fflush may keep its data, and standard C has no call that
+        // discards it). The flush after each record then has nothing to do.
+        setvbuf(m_stream, nullptr, _IONBF, 0);
         if (mask & TRC_INFO)
             TRC1_Printf(&s_checkAndOpenBlock, __LINE__, "Data file <%s> opened successfully.", name.c_str());
+        m_fileName = name;
+        m_fileSize = -1;  // asked for by the first record
+        m_statusCheck = now;
         m_openPeriod = periodStart;
         m_openErrors = 0;
-        m_statusCheck = now;
         return 0;
     }
     if (m_openErrors == 0 && (mask & TRC_ERROR))
@@ -366,7 +419,7 @@ int DataWriter::reopen(wq5_time_t periodStart, wq5_time_t now)
 
 int DataWriter::checkAndOpen()
 {
-    // One clock read serves both the day and the once-a-second status check.
+    // One clock reading per record serves the day and the status checks.
     const wq5_time_t now = currentTime();
     const wq5_time_t periodStart = periodStartAt(now, SECONDS_PER_DAY);
 
@@ -377,6 +430,70 @@ int DataWriter::checkAndOpen()
     if (periodStart > m_openPeriod || m_stream == nullptr)
         return reopen(periodStart, now);
     return 0;
+}
+
+bool DataWriter::writeRecord(const char* data, size_t length)
+{
+    static TRC1_EPB blk = TRC1_BLOCK_INIT(s_unit, "DataWriter::writeRecord");
+    const int mask = trc1Mask(&blk);
+
+    if (m_stream == nullptr)
+        return recordLost(errno);
+    // A record never goes behind the remains of a failed one, nor where a
+    // failure could not be undone.
+    if (!cutBack())
+        return recordLost(errno);
+    // Where a failed record is cut back to. The collector is the file's
+    // only writer, so the size it keeps is the file's end.
+    int64_t start = m_fileSize;
+    if (start < 0) {
+        struct stat64 status;
+        if (fstat64(fileno(m_stream), &status) != 0)
+            return recordLost(errno);
+        start = status.st_size;
+    }
+    m_fileSize = -1;
+
+    errno = 0;
+    if (ioWrite(data, length, m_stream) == length && ioFlush(m_stream) == 0) {
+        if (m_lostRecords > 0) {
+            if (mask & TRC_ERROR)
+                TRC1_Printf(&blk, __LINE__, "Log file writing resumed; %lu records lost.", m_lostRecords);
+            m_lostRecords = 0;
+        }
+        m_fileSize = start + static_cast<int64_t>(length);
+        return true;
+    }
+    const int error = errno;
+    // Take off whatever part of the record reached the file, so that the
+    // file ends on a whole record and the next one starts a line of its
+    // own. The stream holds nothing of it: it has no buffer (see reopen).
+    clearerr(m_stream);
+    m_cutTo = start;
+    if (cutBack())
+        m_fileSize = start;
+    else if (mask & TRC_ERROR)
+        TRC1_Printf(&blk, __LINE__, "Error: Data file <%s> cannot be cut back to <%lld> bytes, errno <%d>",
+                    m_fileName.c_str(), static_cast<long long>(start), errno);
+    return recordLost(error);
+}
+
+bool DataWriter::cutBack()
+{
+    if (m_cutTo < 0)
+        return true;
+    if (ioTruncate(fileno(m_stream), m_cutTo) != 0)
+        return false;
+    m_cutTo = -1;
+    return true;
+}
+
+bool DataWriter::recordLost(int error)
+{
+    if (m_lostRecords < ULONG_MAX)
+        ++m_lostRecords;
+    errno = error;
+    return false;
 }
 
 void DataWriter::release()
@@ -398,4 +515,9 @@ DataWriterLock::~DataWriterLock()
 FILE* DataWriterLock::getStream()
 {
     return m_writer->m_stream;
+}
+
+bool DataWriterLock::writeRecord(const char* data, size_t length)
+{
+    return m_writer->writeRecord(data, length);
 }

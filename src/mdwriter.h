@@ -20,6 +20,21 @@ typedef int64_t wq5_time_t;
 typedef wq5_time_t (*WriterClock)(void);
 void setWriterClock(WriterClock clock);
 
+// The calls through which a record reaches its file: the write, the flush,
+// and the cut that takes a failed record off again. Tests set their own to
+// inject faults (errors, short writes, failing flushes and cuts) into the
+// real write path; a null member is the system's own call. Set only while
+// no record is being written; the production path never sets it.
+struct WriterIo {
+    typedef size_t (*WriteCall)(const void* data, size_t size, size_t count, FILE* stream);
+    typedef int (*FlushCall)(FILE* stream);
+    typedef int (*TruncateCall)(int fd, int64_t length);
+    WriteCall write;
+    FlushCall flush;
+    TruncateCall truncate;
+};
+void setWriterIo(const WriterIo& io);
+
 // Start of the current period of `period` seconds (> 0), periods aligned
 // on the epoch; reads the writer's clock once.
 wq5_time_t calcPeriodStart(wq5_time_t period);
@@ -66,9 +81,19 @@ private:
     // Closes the current file, names the next one, prunes, opens it.
     int reopen(wq5_time_t periodStart, wq5_time_t now);
     // True when the open file must be replaced: it has been removed, or it
-    // is over the size limit. One fstat, at most once a second without a
-    // limit.
+    // is over the size limit. One fstat per record with a limit, at most
+    // one a second without; each refreshes m_fileSize.
     bool openFileStale(wq5_time_t now);
+    // Closes the open file, if any, after a last try to cut off what a
+    // failed record left behind.
+    void closeStream();
+    // See DataWriterLock::writeRecord. Caller holds the writer's mutex.
+    bool writeRecord(const char* data, size_t length);
+    // Cuts the open file back to m_cutTo when a failed record left bytes
+    // behind; true when nothing is left to cut.
+    bool cutBack();
+    // Counts a dropped record; returns false with errno set to `error`.
+    bool recordLost(int error);
     // True when the file `name` exists and is larger than the size limit.
     bool overLimit(const std::string& name) const;
     // The path of sequence number `seq` of the day `date`.
@@ -83,12 +108,16 @@ private:
     long m_maxSizeMb;
     uint32_t m_openErrors;
     int64_t m_maxSizeBytes;     // m_maxSizeMb in bytes, saturated; 0 = no limit
+    std::string m_fileName;     // path of the open file
+    int64_t m_fileSize;         // size of the open file; -1 = unknown
     wq5_time_t m_statusCheck;   // time of the last fstat of the open file
+    int64_t m_cutTo;            // size the open file must be cut back to; -1 = none
+    unsigned long m_lostRecords;  // records dropped since writing last succeeded
 };
 
 // Holds the writer's mutex for one record and brings the file up to date.
-// The only way to reach the stream: construct, getStream, write the whole
-// record with one write, destroy. Never construct one inside the writer's
+// The way to the file: construct, writeRecord (or getStream and one write
+// of the whole record), destroy. Never construct one inside the writer's
 // own operations (the mutex is not recursive).
 class DataWriterLock {
 public:
@@ -100,6 +129,15 @@ public:
     // The open log file, or null when none could be opened: the record is
     // then dropped. Owned by the writer; never close it.
     FILE* getStream();
+    // Writes the whole record with one write and flushes it: true when both
+    // succeeded. False when the record was dropped: no file is open, the
+    // remains of an earlier failed record could not be cut off, or the
+    // write or the flush failed; errno then holds the error number (it is
+    // unspecified when no file is open). Whatever part of a failed record
+    // reached the file is cut off again, so that the file ends on a whole
+    // record. Dropped records are counted, and the next record written
+    // traces their number.
+    bool writeRecord(const char* data, size_t length);
 
 private:
     DataWriterLock(const DataWriterLock&) = delete;

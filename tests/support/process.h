@@ -23,6 +23,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include "support/spawn_program.h"
+
 extern char** environ;
 
 namespace wq5test {
@@ -116,7 +118,7 @@ public:
         envp.push_back(nullptr);
         std::string arg0 = binary;
         char* argv[] = {&arg0[0], nullptr};
-        if (posix_spawn(&m_pid, binary.c_str(), nullptr, nullptr, argv, envp.data()) != 0)
+        if (spawnProgram(&m_pid, binary.c_str(), nullptr, argv, envp.data()) != 0)
             m_pid = -1;
     }
 

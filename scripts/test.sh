@@ -1,8 +1,9 @@
 #!/usr/bin/env bash
-# Builds everything and runs the whole test suite three times: a plain
+# Builds everything and runs the whole test suite four times: a plain
 # build (build/), AddressSanitizer with UndefinedBehaviorSanitizer
-# (build-asan/), and the concurrency tests under ThreadSanitizer
-# (build-tsan/). Exits non-zero when any test fails.
+# (build-asan/), the concurrency tests under ThreadSanitizer (build-tsan/),
+# and a 32-bit build (build-m32/, natively or under qemu-i386). Exits
+# non-zero when any test fails.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/deps.sh
@@ -23,4 +24,5 @@ export TSAN_OPTIONS=halt_on_error=1:second_deadlock_stack=1
 run_suite build ""
 run_suite build-asan "" -DWQ5_SANITIZE=address,undefined
 run_suite build-tsan concurrency -DWQ5_SANITIZE=thread
+run_suite build-m32 "" -DCMAKE_TOOLCHAIN_FILE=cmake/m32.cmake -DWQ5_GTEST_FROM_SOURCE=ON -DWQ5_BENCH=OFF
 echo "All test suites passed."

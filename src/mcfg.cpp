@@ -1,11 +1,27 @@
 #include "mcfg.h"
 
 #include <cstdlib>
+#include <limits>
 #include <unistd.h>
 
 #include "platform/moq.h"
 
 static TRC1_CUB s_unit = TRC1_UNIT_INIT("mcfg");
+
+// The leading decimal number of `text`, as atoi and atol read it, but held
+// to the range of the result type: atoi's result is undefined for a number
+// that does not fit, and a keep-days value that wrapped to a small number
+// would delete nearly every log file.
+template <class Int>
+static Int leadingNumber(const char* text)
+{
+    const long long value = strtoll(text, nullptr, 10);  // saturates on overflow
+    if (value > std::numeric_limits<Int>::max())
+        return std::numeric_limits<Int>::max();
+    if (value < std::numeric_limits<Int>::min())
+        return std::numeric_limits<Int>::min();
+    return static_cast<Int>(value);
+}
 
 bool getBoolEnv(const char* name)
 {
@@ -39,16 +55,16 @@ Config::Config()
     }
 
     m_logDir = QEN1_GetEnv(OPT_LOGDIR, DEFAULT_LOGDIR);
-    m_keepDays = atoi(QEN1_GetEnv(OPT_KEEPDAYS, DEFAULT_KEEPDAYS));
+    m_keepDays = leadingNumber<int>(QEN1_GetEnv(OPT_KEEPDAYS, DEFAULT_KEEPDAYS));
 
-    m_logPercent = atoi(QEN1_GetEnv(OPT_LOG_PCT, DEFAULT_LOG_PCT));
+    m_logPercent = leadingNumber<int>(QEN1_GetEnv(OPT_LOG_PCT, DEFAULT_LOG_PCT));
     if (m_logPercent < 0 || m_logPercent > 100) {
         if (mask & TRC_ERROR)
             TRC1_Printf(&blk, __LINE__, "%s value of %d corrected to 100", OPT_LOG_PCT, m_logPercent);
         m_logPercent = 100;
     }
 
-    m_logMaxSize = atol(QEN1_GetEnv(OPT_LOG_MAX_SIZE, DEFAULT_LOG_MAX_SIZE));
+    m_logMaxSize = leadingNumber<long>(QEN1_GetEnv(OPT_LOG_MAX_SIZE, DEFAULT_LOG_MAX_SIZE));
 
     m_logHttp = getBoolEnv(OPT_LOG_HTTP);
     m_logHttpObj = getBoolEnv(OPT_LOG_HTTPOBJ);

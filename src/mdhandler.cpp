@@ -575,8 +575,8 @@ int DataHandler::addFooter(char* buffer, size_t size, const char* tag)
 
 // ------------------------------------------------------------ whole records
 
-int64_t DataHandler::formatHttpRecord(char* buffer, size_t size, const char* tag, const std::string& guid,
-                                      ZUB_RESPONSE_TIME_DATA* entry)
+int64_t DataHandler::formatRecord(char* buffer, size_t size, const char* tag, const std::string& guid,
+                                  ZUB_RESPONSE_TIME_DATA* entry, FamilyPart family)
 {
     size_t used = 0;
     int n = addHeader(buffer, size, tag, guid);
@@ -586,7 +586,7 @@ int64_t DataHandler::formatHttpRecord(char* buffer, size_t size, const char* tag
     if ((n = addCommon(pieceAt(buffer, size, used), roomAt(size, used), entry)) < 0)
         return -1;
     used += static_cast<size_t>(n);
-    if ((n = addHttpMain(pieceAt(buffer, size, used), roomAt(size, used), entry)) < 0)
+    if ((n = (this->*family)(pieceAt(buffer, size, used), roomAt(size, used), entry)) < 0)
         return -1;
     used += static_cast<size_t>(n);
     if ((n = addFooter(pieceAt(buffer, size, used), roomAt(size, used), tag)) < 0)
@@ -595,30 +595,10 @@ int64_t DataHandler::formatHttpRecord(char* buffer, size_t size, const char* tag
     return static_cast<int64_t>(used);
 }
 
-int64_t DataHandler::formatMediaRecord(char* buffer, size_t size, const char* tag, const std::string& guid,
-                                       ZUB_RESPONSE_TIME_DATA* entry)
-{
-    size_t used = 0;
-    int n = addHeader(buffer, size, tag, guid);
-    if (n < 0)
-        return -1;
-    used += static_cast<size_t>(n);
-    if ((n = addCommon(pieceAt(buffer, size, used), roomAt(size, used), entry)) < 0)
-        return -1;
-    used += static_cast<size_t>(n);
-    if ((n = addMedia(pieceAt(buffer, size, used), roomAt(size, used), entry)) < 0)
-        return -1;
-    used += static_cast<size_t>(n);
-    if ((n = addFooter(pieceAt(buffer, size, used), roomAt(size, used), tag)) < 0)
-        return -1;
-    used += static_cast<size_t>(n);
-    return static_cast<int64_t>(used);
-}
-
-void DataHandler::emitRecord(TRC1_EPB* blk, int mask, char* buffer, RecordFormat format, const char* tag,
+void DataHandler::emitRecord(TRC1_EPB* blk, int mask, char* buffer, FamilyPart family, const char* tag,
                              const std::string& guid, ZUB_RESPONSE_TIME_DATA* entry)
 {
-    const int64_t length = (this->*format)(buffer, RECORD_BUFFER_SIZE, tag, guid, entry);
+    const int64_t length = formatRecord(buffer, RECORD_BUFFER_SIZE, tag, guid, entry, family);
     if (length >= 0 && static_cast<uint64_t>(length) < RECORD_BUFFER_SIZE) {
         writeRecord(blk, mask, buffer, static_cast<size_t>(length));
         return;
@@ -634,7 +614,7 @@ void DataHandler::emitRecord(TRC1_EPB* blk, int mask, char* buffer, RecordFormat
     }
     const size_t size = static_cast<size_t>(length) + 1;
     std::unique_ptr<char[]> large(new (std::nothrow) char[size]);
-    if (!large || (this->*format)(large.get(), size, tag, guid, entry) != length) {
+    if (!large || formatRecord(large.get(), size, tag, guid, entry, family) != length) {
         if (mask & TRC_ERROR)
             TRC1_Printf(blk, __LINE__, "Record of <%lld> bytes with tag <%s> dropped.",
                         static_cast<long long>(length), tag);
@@ -744,7 +724,7 @@ void DataHandler::processHttp(ZUB_RESPONSE_TIME_DATA_TABLE* table)
             // Shows the URL before the delimiter in it is substituted.
             TRC1_Printf(&blk, __LINE__, "    url <%s>", orNA(zubText(entry, entry->detail.url)));
         }
-        emitRecord(&blk, mask, buffer, &DataHandler::formatHttpRecord, tag, guid, entry);
+        emitRecord(&blk, mask, buffer, &DataHandler::addHttpMain, tag, guid, entry);
     }
 }
 
@@ -792,6 +772,6 @@ void DataHandler::processMedia(TRC1_EPB* blk, int mask, ZUB_RESPONSE_TIME_DATA_T
         replace(detail.view.media.mediaText, sizeof(detail.view.media.mediaText), m_delimiter, m_subChar);
 
         guid = generateGuid();
-        emitRecord(blk, mask, buffer, &DataHandler::formatMediaRecord, tag, guid, entry);
+        emitRecord(blk, mask, buffer, &DataHandler::addMedia, tag, guid, entry);
     }
 }

@@ -120,8 +120,8 @@ private:
     DataHandler(const DataHandler&) = delete;
     DataHandler& operator=(const DataHandler&) = delete;
 
-    typedef int64_t (DataHandler::*RecordFormat)(char* buffer, size_t size, const char* tag,
-                                                 const std::string& guid, ZUB_RESPONSE_TIME_DATA* entry);
+    // The columns of a record family: addHttpMain or addMedia.
+    typedef int (DataHandler::*FamilyPart)(char* buffer, size_t size, ZUB_RESPONSE_TIME_DATA* entry);
 
     // True when the table has entries to walk; disconnects the collector
     // when its first entry says the registration is gone.
@@ -130,14 +130,13 @@ private:
                       const char* const* codes, int codeCount, const char* tag);
     // The nine media columns.
     int addMedia(char* buffer, size_t size, ZUB_RESPONSE_TIME_DATA* entry);
-    // A whole record; the length it needs, or -1 when a piece failed.
-    int64_t formatHttpRecord(char* buffer, size_t size, const char* tag, const std::string& guid,
-                             ZUB_RESPONSE_TIME_DATA* entry);
-    int64_t formatMediaRecord(char* buffer, size_t size, const char* tag, const std::string& guid,
-                              ZUB_RESPONSE_TIME_DATA* entry);
+    // A whole record (header, common columns, `family`, footer); the length
+    // it needs, or -1 when a piece failed.
+    int64_t formatRecord(char* buffer, size_t size, const char* tag, const std::string& guid,
+                         ZUB_RESPONSE_TIME_DATA* entry, FamilyPart family);
     // Formats a record into `buffer` (RECORD_BUFFER_SIZE bytes), or whole
     // into a buffer made for it when it does not fit, and writes it.
-    void emitRecord(TRC1_EPB* blk, int mask, char* buffer, RecordFormat format, const char* tag,
+    void emitRecord(TRC1_EPB* blk, int mask, char* buffer, FamilyPart family, const char* tag,
                     const std::string& guid, ZUB_RESPONSE_TIME_DATA* entry);
     // One write of the record under the writer's lock.
     void writeRecord(TRC1_EPB* blk, int mask, const char* record, size_t length);

@@ -5,7 +5,8 @@
 // oldest queued table, finds the filter for its protocol/service and calls
 // that filter's callback with no lock held. Delivery runs only while an
 // application is registered, and not before the start delay after the
-// registration that ended a time without any, so that an application that
+// registration that ended a time without any (and after the application's
+// last filter definition), so that an application that
 // re-registers gets every table queued behind the one that made it drop out.
 //
 // Unregistration closes the application under the lock (no callback of it
@@ -303,6 +304,13 @@ int Simulator::defineFilter(ZUB_APPL_ID* id, const ZUB_FILTER_REQUEST* request)
     const std::shared_ptr<Application>& appl = found->second;
     if (request->requestType == ZUB_REQ_DEFINE_FILTER) {
         ++m_stats.defineRequests;
+        // Delivery starts (or resumes) only a start delay after the last
+        // definition, not after the registration alone: an application
+        // defines its filters one after the other, and on a busy machine
+        // the whole series can take longer than the delay.
+        const auto settled = std::chrono::steady_clock::now() + std::chrono::milliseconds(m_settings.startDelayMs);
+        if (settled > m_resumeAt)
+            m_resumeAt = settled;
         // Defining the same protocol/service again replaces the callback.
         for (Filter& filter : m_filters) {
             if (filter.appl == appl && filter.protocol == request->protocol &&

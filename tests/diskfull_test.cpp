@@ -107,7 +107,7 @@ protected:
             {"MOQ_TRACE", "error"}, {"MOQ_TRACE_FILE", m_out + "/trace.log"}, {"WQ5_COLLECTOR_ID", "wq5coll"},
             {"WQ5_LOG_DIR", m_logDir}, {"WQ5_LOG_MS_VIDEO", "Y"}, {"WQ5_LOG_MAX_SIZE_MB", maxSizeMb},
             {"ZUB1_REPLAY", m_out + "/script.jsonl"}, {"ZUB1_LOOPS", "0"}, {"ZUB1_RATE", "1000"},
-            {"ZUB1_THREADS", "1"}, {"ZUB1_START_DELAY_MS", "0"}};
+            {"ZUB1_THREADS", "1"}, {"ZUB1_START_DELAY_MS", "\x01unset"}};
         for (char** e = environ; *e != nullptr; ++e)  // no other setting of ours
             if (strncmp(*e, "WQ5_", 4) == 0 || strncmp(*e, "ZUB1_", 5) == 0)
                 env.emplace(std::string(*e, strcspn(*e, "=")), "\x01unset");

@@ -102,7 +102,7 @@ protected:
                     {"WQ5_COLLECTOR_ID", "hartest"}, {"WQ5_LOG_DIR", dir + "/log"},
                     {"WQ5_LOG_SAMPLE_PERCENTAGE", "100"}, {"WQ5_LOG_MAX_SIZE_MB", "\x01unset"},
                     {"WQ5_FIELD_DELIMITER", "\x01unset"}, {"WQ5_SUB_CHAR", "\x01unset"}, {"ZUB1_REPLAY", file},
-                    {"ZUB1_STATUS_FILE", dir + "/status.json"}, {"ZUB1_THREADS", "1"}, {"ZUB1_START_DELAY_MS", "0"},
+                    {"ZUB1_STATUS_FILE", dir + "/status.json"}, {"ZUB1_THREADS", "1"}, {"ZUB1_START_DELAY_MS", "\x01unset"},
                     {"ZUB1_REGISTER_FAILURES", "\x01unset"}, {"ZUB1_LOOPS", "\x01unset"}, {"ZUB1_RATE", "\x01unset"}});
         for (const char* kind :
              {"HTTP", "HTTPOBJ", "HTTPS", "MS_VIDEO", "MS_AUDIO", "REAL_VIDEO", "REAL_AUDIO", "QUICKTIME"})

@@ -332,56 +332,27 @@ void DataHandler::calculateLogPercent()
         return;
     }
 
-    m_skipMode = true;
-    if (p >= 99)
-        m_factor = 100;
-    else if (p >= 98)
-        m_factor = 50;
-    else if (p >= 97)
-        m_factor = 34;
-    else if (p >= 96)
-        m_factor = 25;
-    else if (p >= 95)
-        m_factor = 20;
-    else if (p >= 90)
-        m_factor = 10;
-    else if (p >= 85)
-        m_factor = 7;
-    else if (p >= 80)
-        m_factor = 5;
-    else if (p >= 70)
-        m_factor = 4;
-    else if (p >= 60)
-        m_factor = 3;
-    else if (p >= 45)
-        m_factor = 2;
-    else {
-        // Below 45 % only the first record of each group passes.
-        m_skipMode = false;
-        if (p >= 30)
-            m_factor = 3;
-        else if (p >= 25)
-            m_factor = 4;
-        else if (p >= 20)
-            m_factor = 5;
-        else if (p >= 15)
-            m_factor = 6;
-        else if (p >= 10)
-            m_factor = 10;
-        else if (p >= 7)
-            m_factor = 14;
-        else if (p >= 6)
-            m_factor = 16;
-        else if (p >= 5)
-            m_factor = 20;
-        else if (p >= 4)
-            m_factor = 25;
-        else if (p >= 3)
-            m_factor = 33;
-        else if (p >= 2)
-            m_factor = 50;
-        else if (p >= 1)
-            m_factor = 100;
+    // The first row whose threshold the percentage reaches gives the group
+    // length. From 45 % up the last record of each group is dropped (skip
+    // mode); below, only the first record of each group passes.
+    struct Row {
+        int threshold;
+        int factor;
+        bool skipMode;
+    };
+    static const Row rows[] = {
+        {99, 100, true}, {98, 50, true}, {97, 34, true}, {96, 25, true}, {95, 20, true}, {90, 10, true},
+        {85, 7, true},   {80, 5, true},  {70, 4, true},  {60, 3, true},  {45, 2, true},  {30, 3, false},
+        {25, 4, false},  {20, 5, false}, {15, 6, false}, {10, 10, false}, {7, 14, false}, {6, 16, false},
+        {5, 20, false},  {4, 25, false}, {3, 33, false}, {2, 50, false}, {1, 100, false},
+    };
+    m_skipMode = false;  // a percentage below 1 matches no row: keep mode, factor as it was
+    for (const Row& row : rows) {
+        if (p >= row.threshold) {
+            m_factor = row.factor;
+            m_skipMode = row.skipMode;
+            break;
+        }
     }
 
     if (mask & TRC_DETAIL)

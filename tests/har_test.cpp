@@ -104,14 +104,8 @@ protected:
                     {"WQ5_FIELD_DELIMITER", "\x01unset"}, {"WQ5_SUB_CHAR", "\x01unset"}, {"ZUB1_REPLAY", file},
                     {"ZUB1_STATUS_FILE", dir + "/status.json"}, {"ZUB1_THREADS", "1"}, {"ZUB1_START_DELAY_MS", "\x01unset"},
                     {"ZUB1_REGISTER_FAILURES", "\x01unset"}, {"ZUB1_LOOPS", "\x01unset"}, {"ZUB1_RATE", "\x01unset"}});
-        for (const char* kind :
-             {"HTTP", "HTTPOBJ", "HTTPS", "MS_VIDEO", "MS_AUDIO", "REAL_VIDEO", "REAL_AUDIO", "QUICKTIME"})
-            env[std::string("WQ5_LOG_") + kind] = "Y";
         std::optional<Collector> collector;
-        {
-            StderrCapture errors(dir + "/stderr.txt");
-            collector.emplace(collectorBinary(), env);
-        }
+        startAllKinds(collector, env, dir + "/stderr.txt");
         EXPECT_TRUE(collector->started());
         EXPECT_TRUE(waitFor(dir, [&] { return access((dir + "/status.json").c_str(), F_OK) == 0; }))
             << "the library never became idle on " << file;

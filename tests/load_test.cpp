@@ -114,14 +114,8 @@ protected:
                     {"WQ5_FIELD_DELIMITER", UNSET}, {"WQ5_SUB_CHAR", UNSET}, {"ZUB1_STATUS_FILE", dir + "/status.json"},
                     {"ZUB1_START_DELAY_MS", UNSET}, {"ZUB1_REGISTER_FAILURES", UNSET}, {"ZUB1_LOOPS", UNSET},
                     {"ZUB1_RATE", UNSET}});
-        for (const char* kind :
-             {"HTTP", "HTTPOBJ", "HTTPS", "MS_VIDEO", "MS_AUDIO", "REAL_VIDEO", "REAL_AUDIO", "QUICKTIME"})
-            env[std::string("WQ5_LOG_") + kind] = "Y";
         std::optional<Collector> collector;
-        {
-            StderrCapture errors(dir + "/stderr.txt");
-            collector.emplace(collectorBinary(), env);
-        }
+        startAllKinds(collector, env, dir + "/stderr.txt");
         EXPECT_TRUE(collector->started());
         // A collector that dies on the way ends the wait at once; one that
         // hangs is killed when `collector` goes.

@@ -5,6 +5,8 @@
 #define WQ5_TESTS_STDERR_CAPTURE_H
 
 #include <cstdio>
+#include <map>
+#include <optional>
 #include <string>
 
 #include <fcntl.h>
@@ -47,6 +49,17 @@ private:
     std::string m_path;
     int m_saved = -1;
 };
+
+// Starts the collector with every traffic kind switched on (added to
+// `env`), its standard error going to `stderrPath`.
+inline void startAllKinds(std::optional<Collector>& collector, std::map<std::string, std::string> env,
+                          const std::string& stderrPath)
+{
+    for (const char* kind : {"HTTP", "HTTPOBJ", "HTTPS", "MS_VIDEO", "MS_AUDIO", "REAL_VIDEO", "REAL_AUDIO", "QUICKTIME"})
+        env[std::string("WQ5_LOG_") + kind] = "Y";
+    StderrCapture errors(stderrPath);
+    collector.emplace(collectorBinary(), env);
+}
 
 }  // namespace wq5test
 
